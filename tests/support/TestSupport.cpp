@@ -1,0 +1,126 @@
+#include "TestSupport.h"
+
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <spdlog/sinks/base_sink.h>
+#include <sys/ioctl.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+#include "BTHLog.h"
+#include "platform/UniqueFd.h"
+
+namespace berth::test {
+
+namespace {
+
+void clearImmutableTree(const std::filesystem::path& root) {
+    std::error_code ec;
+    setImmutable(root, false);
+    if (!std::filesystem::is_directory(std::filesystem::symlink_status(root, ec))) return;
+    for (auto it = std::filesystem::recursive_directory_iterator(
+             root, std::filesystem::directory_options::skip_permission_denied, ec);
+         !ec && it != std::filesystem::recursive_directory_iterator(); it.increment(ec))
+        if (!it->is_symlink(ec)) setImmutable(it->path(), false);
+}
+
+class CaptureSink final : public spdlog::sinks::base_sink<std::mutex> {
+public:
+    explicit CaptureSink(LogCapture* owner) : owner_(owner) {}
+
+protected:
+    void sink_it_(const spdlog::details::log_msg& msg) override {
+        owner_->record(std::string(msg.payload.data(), msg.payload.size()));
+    }
+    void flush_() override {}
+
+private:
+    LogCapture* owner_;
+};
+
+int levelOf(const std::string& name) {
+    if (name == "error") return 3;
+    if (name == "warning") return 4;
+    if (name == "notice") return 5;
+    if (name == "debug") return 7;
+    return 0;
+}
+
+}  // namespace
+
+ScratchDir::ScratchDir(const std::filesystem::path& parent) {
+    std::string templ = (parent / "berth-test.XXXXXX").string();
+    if (!mkdtemp(templ.data())) throw std::runtime_error("mkdtemp failed in " + parent.string());
+    path_ = templ;
+}
+
+ScratchDir::~ScratchDir() {
+    clearImmutableTree(path_);
+    std::error_code ec;
+    std::filesystem::remove_all(path_, ec);
+}
+
+LogCapture::LogCapture(int threshold) {
+    auto handle = std::make_shared<BTHLogHandle>("test", threshold);
+    handle->addSink(std::make_shared<CaptureSink>(this));
+    BTHLogSetHandle(handle);
+}
+
+LogCapture::~LogCapture() { BTHLogSetHandle(nullptr); }
+
+void LogCapture::record(const std::string& formatted) {
+    // "<level> function: message"
+    Line line{0, {}, formatted};
+    size_t close = formatted.find("> ");
+    if (!formatted.empty() && formatted[0] == '<' && close != std::string::npos) {
+        line.level = levelOf(formatted.substr(1, close - 1));
+        size_t colon = formatted.find(": ", close + 2);
+        if (colon != std::string::npos) {
+            line.function = formatted.substr(close + 2, colon - close - 2);
+            line.message = formatted.substr(colon + 2);
+        }
+    }
+    std::lock_guard lock(mutex_);
+    lines_.push_back(std::move(line));
+}
+
+std::vector<LogCapture::Line> LogCapture::lines() const {
+    std::lock_guard lock(mutex_);
+    return lines_;
+}
+
+bool LogCapture::contains(int level, const std::string& text) const { return count(level, text) > 0; }
+
+size_t LogCapture::count(int level, const std::string& text) const {
+    std::lock_guard lock(mutex_);
+    size_t n = 0;
+    for (const Line& line : lines_)
+        if (line.level == level && line.message.find(text) != std::string::npos) ++n;
+    return n;
+}
+
+void writeFile(const std::filesystem::path& path, const std::string& text) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << text;
+    if (!out) throw std::runtime_error("cannot write " + path.string());
+}
+
+std::string readFile(const std::filesystem::path& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::ostringstream s;
+    s << in.rdbuf();
+    return s.str();
+}
+
+bool setImmutable(const std::filesystem::path& path, bool on) {
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
+    if (!fd) return false;
+    int flags = 0;
+    if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) return false;
+    flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+    return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+}  // namespace berth::test
