@@ -1,0 +1,134 @@
+// BTHFileManager: the daemon's single gateway to the file system for whole
+// items. It removes trees (clearing the immutable flag where that blocks
+// removal), creates directories with a mode, an owner and a protection class,
+// copies and moves trees, makes unique temporary directories, walks trees,
+// lists directories and tests for existence.
+//
+// The trees it works in belong to apps that may swap any component for a
+// symbolic link at any moment. Every operation works through directory file
+// descriptors, acts on the descriptor it checked and never follows a link;
+// a swap mid-operation can make it fail, never redirect it outside the tree.
+//
+// Failures are POSIX-domain errors carrying the error number; none of them
+// logs by itself unless stated. Stateless; safe from any thread.
+#pragma once
+
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "BTHError.h"
+
+namespace berth {
+
+// A path plus the flag telling whether it names a directory.
+struct BTHFileURL {
+    std::filesystem::path path;
+    bool isDirectory = false;
+
+    friend bool operator==(const BTHFileURL&, const BTHFileURL&) = default;
+    std::string description() const { return path.string() + (isDirectory ? "/" : ""); }
+};
+
+// What the tree walk hands its callback for each item.
+struct BTHWalkEntry {
+    // The kinds of item the walk delivers (the callbacks of ACL and ownership
+    // standardisation switch on them).
+    enum class Kind {
+        DirectoryPre,    // a directory, before its contents
+        DirectoryPost,   // the same directory, after its contents
+        DirectoryCycle,  // a directory that is one of its own ancestors
+        Unreadable,      // a directory that could not be opened or read
+        File,            // a regular file
+        Symlink,         // a symbolic link (never followed)
+        Other,           // device, fifo, socket
+    };
+
+    std::filesystem::path path;
+    int level = 0;  // 0 for the root
+    Kind kind = Kind::Other;
+    struct stat st {};  // lstat information of the item
+    int errnum = 0;     // for Unreadable: why
+    // The directory holding the item (open for reading) and the item's name
+    // in it, so callbacks act on the item without resolving its path again.
+    // For the root, parentFd is the root's own parent.
+    int parentFd = -1;
+    std::string name;
+};
+
+class BTHFileManager {
+public:
+    static BTHFileManager& defaultManager();
+
+    // Removes a file, link or directory tree. A missing item anywhere is not
+    // a failure. Items that cannot be removed are passed over; an immutable
+    // item has its flag cleared and is unlinked (logged at notice level).
+    // Fails with the first error number recorded.
+    bool removeItemAtURL(const std::filesystem::path& url, BTHErrorRef* error);
+
+    // Creates the directory (and with `intermediates` its missing parents)
+    // with `mode`. An existing directory is accepted and keeps its mode.
+    // Then, unless `protectionClass` is -1, sets its protection class, and
+    // unless `owner` is 0, chowns it to owner:owner (result ignored).
+    bool createDirectoryAtURL(const std::filesystem::path& url, bool intermediates, mode_t mode,
+                              uid_t owner, int32_t protectionClass, BTHErrorRef* error);
+    bool createDirectoryAtURL(const std::filesystem::path& url, bool intermediates, mode_t mode,
+                              uid_t owner, BTHErrorRef* error);
+    bool createDirectoryAtURLWithClass(const std::filesystem::path& url, bool intermediates,
+                                       mode_t mode, int32_t protectionClass, BTHErrorRef* error);
+    bool createDirectoryAtURL(const std::filesystem::path& url, bool intermediates, mode_t mode,
+                              BTHErrorRef* error);
+
+    // Copies a tree keeping data, mode, owner, times, extended attributes
+    // (ACLs included), flags and links (copied as links).
+    bool copyItemAtURL(const std::filesystem::path& source, const std::filesystem::path& dest,
+                       BTHErrorRef* error);
+    bool copyItemIfExistsAtURL(const std::filesystem::path& source,
+                               const std::filesystem::path& dest, BTHErrorRef* error);
+
+    // Renames; across file systems copies, then removes the source (a source
+    // that cannot be removed is logged and the move still succeeds).
+    bool moveItemAtURL(const std::filesystem::path& source, const std::filesystem::path& dest,
+                       BTHErrorRef* error);
+    bool moveItemIfExistsAtURL(const std::filesystem::path& source,
+                               const std::filesystem::path& dest, BTHErrorRef* error);
+
+    // Creates "<prefix>XXXXXX" (unique suffix, mode 0700) in `parent`.
+    std::optional<BTHFileURL> createTemporaryDirectoryInDirectoryURL(
+        const std::filesystem::path& parent, const std::string& prefix, BTHErrorRef* error);
+    std::optional<BTHFileURL> createTemporaryDirectoryInDirectoryURL(
+        const std::filesystem::path& parent, BTHErrorRef* error);
+
+    // Walks the tree at `root` without following links or crossing into
+    // other file systems, pre- and post-order, in directory order. The
+    // callback answers whether to go on; false ends the walk with failure and
+    // the error the callback left in its slot.
+    using WalkCallback = std::function<bool(const BTHWalkEntry& entry, BTHErrorRef* error)>;
+    bool traverseDirectory(const std::filesystem::path& root, BTHErrorRef* error,
+                           const WalkCallback& callback);
+
+    // The items of a directory in directory order, names beginning with "."
+    // skipped, directories flagged.
+    std::optional<std::vector<BTHFileURL>> urlsForItemsInDirectoryAtURL(
+        const std::filesystem::path& directory, BTHErrorRef* error);
+
+    // lstat-based (a dangling link exists). Not complements: when existence
+    // cannot be determined both answer false.
+    bool itemExistsAtURL(const std::filesystem::path& url);
+    bool itemDoesNotExistAtURL(const std::filesystem::path& url);
+
+private:
+    BTHFileManager() = default;
+    bool copyItem(const std::filesystem::path& source, const std::filesystem::path& dest,
+                  bool failIfSrcMissing, BTHErrorRef* error);
+    bool moveItem(const std::filesystem::path& source, const std::filesystem::path& dest,
+                  bool failIfSrcMissing, BTHErrorRef* error);
+};
+
+}  // namespace berth
