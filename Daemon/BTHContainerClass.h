@@ -43,11 +43,15 @@ inline constexpr uid_t kBTHLegacyMobileUserId = 501;
 // an empty view for any other invalid value.
 std::string_view BTHContainerClassName(uint64_t containerClass);
 
-inline constexpr bool BTHContainerClassIsValid(uint64_t c) { return c >= 1 && c <= 13; }
+inline constexpr bool BTHContainerClassIsValid(uint64_t c) {
+    return c >= 1 && c <= 13;
+}
 inline constexpr bool BTHContainerClassIsBundle(uint64_t c) {
     return c == 1 || c == 3 || c == 5 || c == 8;
 }
-inline constexpr bool BTHContainerClassIsSystem(uint64_t c) { return c == 12 || c == 13; }
+inline constexpr bool BTHContainerClassIsSystem(uint64_t c) {
+    return c == 12 || c == 13;
+}
 inline constexpr bool BTHContainerClassIsGlobal(uint64_t c) {
     return BTHContainerClassIsBundle(c) || BTHContainerClassIsSystem(c);
 }

@@ -48,8 +48,8 @@ std::string BTHError::description() const {
 BTHErrorRef BTHCreateErrorv(const char* function, int line, std::string_view domain, int32_t code,
                             BTHErrorRef underlying, const Value* extraUserInfo, int logFlag,
                             const char* descriptionFormat, std::span<const FormatArg> args) {
-    Value userInfo = extraUserInfo && extraUserInfo->isDictionary() ? *extraUserInfo
-                                                                    : Value::dictionary();
+    Value userInfo =
+        extraUserInfo && extraUserInfo->isDictionary() ? *extraUserInfo : Value::dictionary();
     if (descriptionFormat) {
         std::string description = formatv(descriptionFormat, args);
         if (logFlag == 1 && BTHLogEnabled(BTHLogLevelError)) {
@@ -68,7 +68,8 @@ BTHErrorRef BTHCreateErrorv(const char* function, int line, std::string_view dom
 BTHErrorRef BTHCreatePOSIXErrorv(const char* function, int line, int errnum,
                                  const char* descriptionFormat, std::span<const FormatArg> args) {
     Value userInfo = Value::dictionary();
-    if (descriptionFormat) userInfo.set(kBTHLocalizedDescriptionKey, formatv(descriptionFormat, args));
+    if (descriptionFormat)
+        userInfo.set(kBTHLocalizedDescriptionKey, formatv(descriptionFormat, args));
     userInfo.set(kBTHFunctionNameKey, function ? function : "");
     userInfo.set(kBTHSourceFileLineKey, static_cast<int64_t>(line));
     return std::make_shared<const BTHError>(std::string(kBTHPOSIXErrorDomain), errnum,
@@ -110,7 +111,9 @@ BTHErrorRef BTHCreateExceptionError(const char* function, int line, const std::e
                           "Got exception: %@ : %@", exceptionText(e), callStackSymbols());
 }
 
-void BTHSetExceptionReporter(BTHExceptionReporter reporter) { reporterSlot().store(reporter); }
+void BTHSetExceptionReporter(BTHExceptionReporter reporter) {
+    reporterSlot().store(reporter);
+}
 
 void BTHReportCaughtException(const BTHErrorRef& error) {
     if (!DeviceProperties::isInternalBuild()) return;

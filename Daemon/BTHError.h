@@ -38,7 +38,7 @@ class BTHError;
 using BTHErrorRef = std::shared_ptr<const BTHError>;
 
 class BTHError {
-public:
+  public:
     // `userInfo` must be a dictionary; the underlying error is kept beside it
     // (reached through underlyingError()), as a dictionary cannot hold it.
     BTHError(std::string domain, int32_t code, Value userInfo, BTHErrorRef underlying);
@@ -65,7 +65,7 @@ public:
     // with the underlying error's description nested.
     std::string description() const;
 
-private:
+  private:
     std::string domain_;
     int32_t code_;
     Value userInfo_;
@@ -138,11 +138,11 @@ void BTHReportCaughtException(const BTHErrorRef& error);
 
 // The makers as the daemon's code uses them, under the enclosing function's
 // BTH_FUNCTION name and the current source line.
-#define BTHMakeError(code, underlying, ...)                                                   \
-    ::berth::BTHCreateError(bthFunctionName, __LINE__, ::berth::kBTHErrorDomain, code,        \
-                            underlying, nullptr, 1, __VA_ARGS__)
-#define BTHMakeUnloggedError(code, underlying, ...)                                           \
-    ::berth::BTHCreateError(bthFunctionName, __LINE__, ::berth::kBTHErrorDomain, code,        \
-                            underlying, nullptr, 0, __VA_ARGS__)
+#define BTHMakeError(code, underlying, ...)                                                        \
+    ::berth::BTHCreateError(bthFunctionName, __LINE__, ::berth::kBTHErrorDomain, code, underlying, \
+                            nullptr, 1, __VA_ARGS__)
+#define BTHMakeUnloggedError(code, underlying, ...)                                                \
+    ::berth::BTHCreateError(bthFunctionName, __LINE__, ::berth::kBTHErrorDomain, code, underlying, \
+                            nullptr, 0, __VA_ARGS__)
 #define BTHMakePOSIXError(errnum, ...) \
     ::berth::BTHCreatePOSIXError(bthFunctionName, __LINE__, errnum, __VA_ARGS__)

@@ -34,11 +34,16 @@ std::string composeLine(int level, std::string_view function, std::string_view m
 
 const char* BTHLogLevelName(int level) {
     switch (level) {
-        case BTHLogLevelError: return "error";
-        case BTHLogLevelWarning: return "warning";
-        case BTHLogLevelNotice: return "notice";
-        case BTHLogLevelDebug: return "debug";
-        default: return "log";
+        case BTHLogLevelError:
+            return "error";
+        case BTHLogLevelWarning:
+            return "warning";
+        case BTHLogLevelNotice:
+            return "notice";
+        case BTHLogLevelDebug:
+            return "debug";
+        default:
+            return "log";
     }
 }
 
@@ -67,9 +72,13 @@ void BTHLogHandle::write(int level, std::string_view function, std::string_view 
     logger_->log(spdlog::level::info, composeLine(level, function, message));
 }
 
-std::shared_ptr<BTHLogHandle> BTHLogGetHandle() { return handleSlot().load(); }
+std::shared_ptr<BTHLogHandle> BTHLogGetHandle() {
+    return handleSlot().load();
+}
 
-void BTHLogSetHandle(std::shared_ptr<BTHLogHandle> handle) { handleSlot().store(std::move(handle)); }
+void BTHLogSetHandle(std::shared_ptr<BTHLogHandle> handle) {
+    handleSlot().store(std::move(handle));
+}
 
 bool BTHLogEnabled(int level) {
     std::shared_ptr<BTHLogHandle> handle = BTHLogGetHandle();

@@ -36,7 +36,7 @@ enum BTHLogLevel : int {
 };
 
 class BTHLogHandle {
-public:
+  public:
     // A handle under `name` with the given level threshold that writes
     // nowhere until disk logging is enabled.
     BTHLogHandle(std::string name, int threshold);
@@ -54,7 +54,7 @@ public:
 
     void write(int level, std::string_view function, std::string_view message);
 
-private:
+  private:
     int threshold_;
     std::shared_ptr<spdlog::logger> logger_;
 };

@@ -33,8 +33,8 @@ bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
 // durably. errno tells why on failure; no temporary file is left behind.
 bool writeAtomically(int dirFd, const std::string& name, const std::vector<uint8_t>& bytes) {
     const std::string temp = "." + name + "." + Uuid::random().string() + ".tmp";
-    UniqueFd fd(::openat(dirFd, temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
-                         0644));
+    UniqueFd fd(
+        ::openat(dirFd, temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!fd) return false;
     bool ok = writeAll(fd.get(), bytes) && ::fsync(fd.get()) == 0;
     int saved = errno;
@@ -47,8 +47,8 @@ bool writeAtomically(int dirFd, const std::string& name, const std::vector<uint8
 }
 
 bool writeInPlace(int dirFd, const std::string& name, const std::vector<uint8_t>& bytes) {
-    UniqueFd fd(::openat(dirFd, name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC,
-                         0644));
+    UniqueFd fd(
+        ::openat(dirFd, name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
     return fd && writeAll(fd.get(), bytes);
 }
 

@@ -43,10 +43,16 @@ bool boolProperty(const char* key) {
 
 }  // namespace
 
-bool DeviceProperties::isInternalBuild() { return boolProperty("InternalBuild"); }
+bool DeviceProperties::isInternalBuild() {
+    return boolProperty("InternalBuild");
+}
 
-bool DeviceProperties::isMultiUser() { return boolProperty("MultiUser"); }
+bool DeviceProperties::isMultiUser() {
+    return boolProperty("MultiUser");
+}
 
-uint32_t DeviceProperties::multiUserFlags() { return isMultiUser() ? (1u << 31) : 0; }
+uint32_t DeviceProperties::multiUserFlags() {
+    return isMultiUser() ? (1u << 31) : 0;
+}
 
 }  // namespace berth

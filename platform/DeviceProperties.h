@@ -8,7 +8,7 @@
 namespace berth {
 
 class DeviceProperties {
-public:
+  public:
     // Read on every call: an administrator may change the file while the
     // daemon runs and expects the next request to see it.
     static bool isInternalBuild();

@@ -10,7 +10,7 @@
 namespace berth {
 
 class DeviceRoot {
-public:
+  public:
     // The root, absolute and without trailing slash ("/" for the host).
     static const std::filesystem::path& path();
     static bool isHost() { return path() == "/"; }

@@ -16,7 +16,7 @@
 namespace berth {
 
 class RotatingLogSink final : public spdlog::sinks::base_sink<std::mutex> {
-public:
+  public:
     // Opens (creating, mode 0644) the log at `path`. `rotatedFiles` is how
     // many rotated files are kept beside it. Throws spdlog::spdlog_ex if the
     // file cannot be opened.
@@ -25,11 +25,11 @@ public:
     // The name of the n-th rotated file ("berthd.log.n").
     static std::filesystem::path rotatedPath(const std::filesystem::path& path, uint32_t n);
 
-protected:
+  protected:
     void sink_it_(const spdlog::details::log_msg& msg) override;
     void flush_() override;
 
-private:
+  private:
     void openCurrent();
     void rotate();
 

@@ -5,7 +5,8 @@ namespace berth {
 std::string_view BTHErrorCodeName(uint64_t code) {
     switch (code) {
 #define BTH_CODE_NAME(name) \
-    case name: return #name;
+    case name:              \
+        return #name;
         BTH_CODE_NAME(BTHErrorSuccess)
         BTH_CODE_NAME(BTHErrorMoveAsideFailed)
         BTH_CODE_NAME(BTHErrorRemoveTransientFailed)
@@ -50,7 +51,8 @@ std::string_view BTHErrorCodeName(uint64_t code) {
         BTH_CODE_NAME(BTHErrorACLFailed)
         BTH_CODE_NAME(BTHErrorStageSharedContentFailed)
 #undef BTH_CODE_NAME
-        default: return {};
+        default:
+            return {};
     }
 }
 

@@ -7,37 +7,55 @@ namespace berth {
 
 int64_t FormatArg::asSigned() const {
     switch (kind_) {
-        case Kind::Signed: return signed_;
-        case Kind::Unsigned: return static_cast<int64_t>(unsigned_);
-        case Kind::Double: return static_cast<int64_t>(double_);
-        case Kind::Pointer: return static_cast<int64_t>(reinterpret_cast<uintptr_t>(pointer_));
-        case Kind::Text: return 0;
+        case Kind::Signed:
+            return signed_;
+        case Kind::Unsigned:
+            return static_cast<int64_t>(unsigned_);
+        case Kind::Double:
+            return static_cast<int64_t>(double_);
+        case Kind::Pointer:
+            return static_cast<int64_t>(reinterpret_cast<uintptr_t>(pointer_));
+        case Kind::Text:
+            return 0;
     }
     return 0;
 }
 
-uint64_t FormatArg::asUnsigned() const { return static_cast<uint64_t>(asSigned()); }
+uint64_t FormatArg::asUnsigned() const {
+    return static_cast<uint64_t>(asSigned());
+}
 
 double FormatArg::asDouble() const {
     switch (kind_) {
-        case Kind::Signed: return static_cast<double>(signed_);
-        case Kind::Unsigned: return static_cast<double>(unsigned_);
-        case Kind::Double: return double_;
-        default: return 0;
+        case Kind::Signed:
+            return static_cast<double>(signed_);
+        case Kind::Unsigned:
+            return static_cast<double>(unsigned_);
+        case Kind::Double:
+            return double_;
+        default:
+            return 0;
     }
 }
 
 std::string FormatArg::asText() const {
     char buffer[64];
     switch (kind_) {
-        case Kind::Signed: snprintf(buffer, sizeof buffer, "%" PRId64, signed_); return buffer;
-        case Kind::Unsigned: snprintf(buffer, sizeof buffer, "%" PRIu64, unsigned_); return buffer;
-        case Kind::Double: snprintf(buffer, sizeof buffer, "%g", double_); return buffer;
+        case Kind::Signed:
+            snprintf(buffer, sizeof buffer, "%" PRId64, signed_);
+            return buffer;
+        case Kind::Unsigned:
+            snprintf(buffer, sizeof buffer, "%" PRIu64, unsigned_);
+            return buffer;
+        case Kind::Double:
+            snprintf(buffer, sizeof buffer, "%g", double_);
+            return buffer;
         case Kind::Pointer:
             if (!pointer_) return "(null)";
             snprintf(buffer, sizeof buffer, "%p", pointer_);
             return buffer;
-        case Kind::Text: return text_;
+        case Kind::Text:
+            return text_;
     }
     return {};
 }
@@ -121,7 +139,8 @@ std::string formatOne(const Spec& spec, const FormatArg& arg) {
         case 'o':
             if (arg.kind() == FormatArg::Kind::Text) return formatText(spec, arg.asText());
             return formatInteger(spec, arg);
-        case 'c': return std::string(1, static_cast<char>(arg.asSigned()));
+        case 'c':
+            return std::string(1, static_cast<char>(arg.asSigned()));
         case 'f':
         case 'F':
         case 'g':
@@ -138,7 +157,8 @@ std::string formatOne(const Spec& spec, const FormatArg& arg) {
             return buffer;
         case 's':
         case '@':
-        default: return formatText(spec, arg.asText());
+        default:
+            return formatText(spec, arg.asText());
     }
 }
 

@@ -35,15 +35,16 @@ concept Describable = requires(const T& t) {
 
 // One captured argument.
 class FormatArg {
-public:
+  public:
     enum class Kind { Signed, Unsigned, Double, Text, Pointer };
 
     template <typename T>
-        requires(std::is_integral_v<T> && std::is_signed_v<T>)
-    FormatArg(T v) : kind_(Kind::Signed), signed_(v) {}
+    requires(std::is_integral_v<T>&& std::is_signed_v<T>) FormatArg(T v)
+        : kind_(Kind::Signed), signed_(v) {}
     template <typename T>
-        requires(std::is_integral_v<T> && std::is_unsigned_v<T> && !std::is_same_v<T, bool>)
-    FormatArg(T v) : kind_(Kind::Unsigned), unsigned_(v) {}
+    requires(std::is_integral_v<T>&& std::is_unsigned_v<T> && !std::is_same_v<T, bool>)
+        FormatArg(T v)
+        : kind_(Kind::Unsigned), unsigned_(v) {}
     FormatArg(bool v) : kind_(Kind::Signed), signed_(v ? 1 : 0) {}
     FormatArg(double v) : kind_(Kind::Double), double_(v) {}
     FormatArg(float v) : kind_(Kind::Double), double_(v) {}
@@ -72,7 +73,7 @@ public:
     std::string asText() const;
     const void* asPointer() const { return pointer_; }
 
-private:
+  private:
     Kind kind_;
     int64_t signed_ = 0;
     uint64_t unsigned_ = 0;

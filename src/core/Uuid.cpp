@@ -17,7 +17,9 @@ int hexValue(char c) {
     return -1;
 }
 
-constexpr bool isDashPosition(size_t i) { return i == 8 || i == 13 || i == 18 || i == 23; }
+constexpr bool isDashPosition(size_t i) {
+    return i == 8 || i == 13 || i == 18 || i == 23;
+}
 
 }  // namespace
 

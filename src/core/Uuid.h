@@ -11,7 +11,7 @@
 namespace berth {
 
 class Uuid {
-public:
+  public:
     using Bytes = std::array<uint8_t, 16>;
 
     // The nil UUID (all zero bytes).
@@ -34,7 +34,7 @@ public:
     friend bool operator==(const Uuid&, const Uuid&) = default;
     friend auto operator<=>(const Uuid&, const Uuid&) = default;
 
-private:
+  private:
     Bytes bytes_;
 };
 

@@ -10,7 +10,9 @@ namespace berth {
 
 namespace {
 
-size_t mix(size_t seed, size_t h) { return seed ^ (h + 0x9E3779B97F4A7C15ULL + (seed << 6) + (seed >> 2)); }
+size_t mix(size_t seed, size_t h) {
+    return seed ^ (h + 0x9E3779B97F4A7C15ULL + (seed << 6) + (seed >> 2));
+}
 
 // Integers are compared as mathematical values; this is their common key.
 struct IntegerKey {
@@ -52,17 +54,28 @@ void appendQuoted(std::string& out, const std::string& s) {
 
 const char* kindName(Value::Kind kind) {
     switch (kind) {
-        case Value::Kind::Null: return "null";
-        case Value::Kind::Bool: return "bool";
-        case Value::Kind::Int64: return "int64";
-        case Value::Kind::UInt64: return "uint64";
-        case Value::Kind::Double: return "double";
-        case Value::Kind::String: return "string";
-        case Value::Kind::Data: return "data";
-        case Value::Kind::Date: return "date";
-        case Value::Kind::Uuid: return "uuid";
-        case Value::Kind::Array: return "array";
-        case Value::Kind::Dictionary: return "dictionary";
+        case Value::Kind::Null:
+            return "null";
+        case Value::Kind::Bool:
+            return "bool";
+        case Value::Kind::Int64:
+            return "int64";
+        case Value::Kind::UInt64:
+            return "uint64";
+        case Value::Kind::Double:
+            return "double";
+        case Value::Kind::String:
+            return "string";
+        case Value::Kind::Data:
+            return "data";
+        case Value::Kind::Date:
+            return "date";
+        case Value::Kind::Uuid:
+            return "uuid";
+        case Value::Kind::Array:
+            return "array";
+        case Value::Kind::Dictionary:
+            return "dictionary";
     }
     return "unknown";
 }
@@ -136,8 +149,10 @@ bool operator==(const Value& a, const Value& b) {
 size_t Value::hash() const {
     size_t seed = std::hash<int>()(isInteger() ? -1 : static_cast<int>(kind()));
     switch (kind()) {
-        case Kind::Null: return seed;
-        case Kind::Bool: return mix(seed, *boolValue());
+        case Kind::Null:
+            return seed;
+        case Kind::Bool:
+            return mix(seed, *boolValue());
         case Kind::Int64:
         case Kind::UInt64: {
             IntegerKey key = integerKey(*this);
@@ -147,12 +162,15 @@ size_t Value::hash() const {
             double d = std::get<double>(storage_);
             return mix(seed, d == 0 ? 0 : std::hash<double>()(d));
         }
-        case Kind::String: return mix(seed, std::hash<std::string>()(*string()));
+        case Kind::String:
+            return mix(seed, std::hash<std::string>()(*string()));
         case Kind::Data:
             return mix(seed, std::hash<std::string_view>()(std::string_view(
                                  reinterpret_cast<const char*>(data()->data()), data()->size())));
-        case Kind::Date: return mix(seed, std::hash<double>()(date()->secondsSince1970));
-        case Kind::Uuid: return mix(seed, std::hash<berth::Uuid>()(*uuid()));
+        case Kind::Date:
+            return mix(seed, std::hash<double>()(date()->secondsSince1970));
+        case Kind::Uuid:
+            return mix(seed, std::hash<berth::Uuid>()(*uuid()));
         case Kind::Array:
             for (const Value& v : *arrayValue()) seed = mix(seed, v.hash());
             return seed;
@@ -173,8 +191,12 @@ std::string Value::description() const {
 void Value::describe(std::string& out, int indent, bool topLevel) const {
     char buffer[64];
     switch (kind()) {
-        case Kind::Null: out += "(null)"; return;
-        case Kind::Bool: out += *boolValue() ? "1" : "0"; return;
+        case Kind::Null:
+            out += "(null)";
+            return;
+        case Kind::Bool:
+            out += *boolValue() ? "1" : "0";
+            return;
         case Kind::Int64:
             snprintf(buffer, sizeof buffer, "%" PRId64, std::get<int64_t>(storage_));
             out += buffer;
@@ -210,7 +232,9 @@ void Value::describe(std::string& out, int indent, bool topLevel) const {
             out += buffer;
             return;
         }
-        case Kind::Uuid: out += uuid()->string(); return;
+        case Kind::Uuid:
+            out += uuid()->string();
+            return;
         case Kind::Array: {
             const std::string pad(indent * 4 + 4, ' ');
             out += "(\n";

@@ -29,8 +29,20 @@
 namespace berth {
 
 class Value {
-public:
-    enum class Kind { Null, Bool, Int64, UInt64, Double, String, Data, Date, Uuid, Array, Dictionary };
+  public:
+    enum class Kind {
+        Null,
+        Bool,
+        Int64,
+        UInt64,
+        Double,
+        String,
+        Data,
+        Date,
+        Uuid,
+        Array,
+        Dictionary
+    };
 
     using Array = std::vector<Value>;
     using Dictionary = std::map<std::string, Value, std::less<>>;
@@ -46,12 +58,12 @@ public:
     Value(std::nullptr_t) {}
     Value(bool b) : storage_(b) {}
     template <typename T>
-        requires(std::is_integral_v<T> && std::is_signed_v<T> && !std::is_same_v<T, bool> &&
-                 !std::is_same_v<T, char>)
-    Value(T v) : storage_(static_cast<int64_t>(v)) {}
+    requires(std::is_integral_v<T>&& std::is_signed_v<T> && !std::is_same_v<T, bool> &&
+             !std::is_same_v<T, char>) Value(T v)
+        : storage_(static_cast<int64_t>(v)) {}
     template <typename T>
-        requires(std::is_integral_v<T> && std::is_unsigned_v<T> && !std::is_same_v<T, bool>)
-    Value(T v) : storage_(static_cast<uint64_t>(v)) {}
+    requires(std::is_integral_v<T>&& std::is_unsigned_v<T> && !std::is_same_v<T, bool>) Value(T v)
+        : storage_(static_cast<uint64_t>(v)) {}
     Value(double d) : storage_(d) {}
     Value(const char* s) : storage_(std::string(s)) {}
     Value(std::string_view s) : storage_(std::string(s)) {}
@@ -114,7 +126,7 @@ public:
     // level, containers in a property-list-like notation.
     std::string description() const;
 
-private:
+  private:
     void describe(std::string& out, int indent, bool topLevel) const;
 
     std::variant<std::monostate, bool, int64_t, uint64_t, double, std::string, Data, Date,

@@ -27,16 +27,16 @@ void clearImmutableTree(const std::filesystem::path& root) {
 }
 
 class CaptureSink final : public spdlog::sinks::base_sink<std::mutex> {
-public:
+  public:
     explicit CaptureSink(LogCapture* owner) : owner_(owner) {}
 
-protected:
+  protected:
     void sink_it_(const spdlog::details::log_msg& msg) override {
         owner_->record(std::string(msg.payload.data(), msg.payload.size()));
     }
     void flush_() override {}
 
-private:
+  private:
     LogCapture* owner_;
 };
 
@@ -68,7 +68,9 @@ LogCapture::LogCapture(int threshold) {
     BTHLogSetHandle(handle);
 }
 
-LogCapture::~LogCapture() { BTHLogSetHandle(nullptr); }
+LogCapture::~LogCapture() {
+    BTHLogSetHandle(nullptr);
+}
 
 void LogCapture::record(const std::string& formatted) {
     // "<level> function: message"
@@ -91,7 +93,9 @@ std::vector<LogCapture::Line> LogCapture::lines() const {
     return lines_;
 }
 
-bool LogCapture::contains(int level, const std::string& text) const { return count(level, text) > 0; }
+bool LogCapture::contains(int level, const std::string& text) const {
+    return count(level, text) > 0;
+}
 
 size_t LogCapture::count(int level, const std::string& text) const {
     std::lock_guard lock(mutex_);

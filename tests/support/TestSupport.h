@@ -15,7 +15,7 @@ namespace berth::test {
 // A fresh directory under /tmp (or under `parent`), removed with everything
 // in it (immutable flags cleared) when the object goes.
 class ScratchDir {
-public:
+  public:
     explicit ScratchDir(const std::filesystem::path& parent = "/tmp");
     ~ScratchDir();
     ScratchDir(const ScratchDir&) = delete;
@@ -24,14 +24,14 @@ public:
     const std::filesystem::path& path() const { return path_; }
     std::filesystem::path operator/(const std::string& name) const { return path_ / name; }
 
-private:
+  private:
     std::filesystem::path path_;
 };
 
 // Every line the daemon logs while this object lives (level, function and
 // message), including lines that the level threshold would write.
 class LogCapture {
-public:
+  public:
     struct Line {
         int level;
         std::string function;
@@ -49,7 +49,7 @@ public:
     // Called by the sink.
     void record(const std::string& formatted);
 
-private:
+  private:
     mutable std::mutex mutex_;
     std::vector<Line> lines_;
 };
@@ -64,7 +64,7 @@ bool setImmutable(const std::filesystem::path& path, bool on);
 }  // namespace berth::test
 
 // Skips the current test, with the reason, when not running as root.
-#define BERTH_REQUIRE_ROOT()                                                 \
-    do {                                                                     \
-        if (::geteuid() != 0) GTEST_SKIP() << "needs root (run as uid 0)";   \
+#define BERTH_REQUIRE_ROOT()                                               \
+    do {                                                                   \
+        if (::geteuid() != 0) GTEST_SKIP() << "needs root (run as uid 0)"; \
     } while (0)
