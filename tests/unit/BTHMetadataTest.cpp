@@ -1,0 +1,383 @@
+#include "BTHMetadata.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+
+#include "BTHPropertyListFile.h"
+#include "TestSupport.h"
+#include "platform/PropertyList.h"
+
+namespace berth {
+namespace {
+
+namespace fs = std::filesystem;
+using test::LogCapture;
+using test::ScratchDir;
+
+constexpr const char* kReadName =
+    "+[BTHMetadata readAndValidateMetadataAtUrl:forUser:checkClassPath:error:]";
+constexpr const char* kWriteName = "-[BTHMetadata writeMetadataToDiskWithError:]";
+const Uuid kUuid = *Uuid::parse("1b4e28ba-2fa1-11d2-883f-0016d3cca427");
+
+// A container tree in a scratch directory: <scratch>/Containers/<class>/<UUID>.
+class BTHMetadataTest : public ::testing::Test {
+  protected:
+    fs::path makeContainer(const std::string& className) {
+        fs::path url = scratch_.path() / "Containers" / className / Uuid::random().string();
+        fs::create_directories(url);
+        return url;
+    }
+
+    // The file of a valid per-user data container of user 501.
+    static Value validFile() {
+        Value dict = Value::dictionary();
+        dict.set(kBTHMetadataIdentifierKey, "com.example.app");
+        dict.set(kBTHMetadataUUIDKey, kUuid.string());
+        dict.set(kBTHMetadataContentClassKey, uint64_t{2});
+        dict.set(kBTHMetadataPersonaKey, uint32_t{501});
+        return dict;
+    }
+
+    static void writeFile(const fs::path& container, const Value& dict) {
+        BTHErrorRef error;
+        ASSERT_TRUE(BTH_writeToURL(dict, BTHMetadata::metadataFileURL(container),
+                                   kBTHStateFileWriteOptions, &error))
+            << (error ? error->description() : "");
+    }
+
+    static Value storedFile(const fs::path& container) {
+        std::optional<Value> dict = BTH_dictionaryWithContentsOfURL(
+            BTHMetadata::metadataFileURL(container), BTHReadImmutable, nullptr);
+        return dict ? *dict : Value();
+    }
+
+    // Reads and expects failure with `code` and `message`, made and logged
+    // once under the read's own name.
+    static void expectReadFailure(const fs::path& container, uid_t user, bool checkClassPath,
+                                  int32_t code, const std::string& message) {
+        LogCapture log;
+        BTHErrorRef error;
+        EXPECT_EQ(
+            BTHMetadata::readAndValidateMetadataAtUrl(container, user, checkClassPath, &error),
+            nullptr);
+        ASSERT_NE(error, nullptr);
+        EXPECT_TRUE(error->isBTHError(code)) << error->description();
+        EXPECT_EQ(error->localizedDescription(), message);
+        EXPECT_EQ(error->functionName(), kReadName);
+        auto lines = log.lines();
+        ASSERT_EQ(lines.size(), 1u);
+        EXPECT_EQ(lines[0].level, BTHLogLevelError);
+        EXPECT_EQ(lines[0].function, kReadName);
+        EXPECT_NE(lines[0].message.find(message), std::string::npos) << lines[0].message;
+    }
+
+    ScratchDir scratch_;
+};
+
+TEST_F(BTHMetadataTest, WriteThenReadGivesTheSameRecordWithExactlyTheDefinedKeys) {
+    const fs::path url = makeContainer("Data/Application");
+    Value nested = Value::dictionary();
+    nested.set("list", Value(Value::Array{Value(int64_t{-3}), Value("x"), Value(true)}));
+    nested.set("blob", Value(Value::Data{0, 1, 0xff}));
+    Value info = Value::dictionary();
+    info.set("sys.kelp.Lading.ContentProtectionClass", int32_t{3});
+    info.set("nested", nested);
+    BTHMetadata written(501, kUuid, 2, "com.example.app", info, url, "Assets");
+    ASSERT_TRUE(written.writeMetadataToDisk(nullptr));
+
+    std::shared_ptr<BTHMetadata> read =
+        BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, nullptr);
+    ASSERT_NE(read, nullptr);
+    EXPECT_EQ(*read, written);
+
+    const std::string bytes = test::readFile(BTHMetadata::metadataFileURL(url));
+    EXPECT_EQ(bytes.substr(0, 8), "bplist00");
+    Value stored = storedFile(url);
+    ASSERT_EQ(stored.size(), 6u);
+    EXPECT_EQ(*stored.find(kBTHMetadataUUIDKey), Value("1B4E28BA-2FA1-11D2-883F-0016D3CCA427"));
+    EXPECT_EQ(*stored.find(kBTHMetadataContentClassKey), Value(uint64_t{2}));
+    EXPECT_EQ(*stored.find(kBTHMetadataPersonaKey), Value(uint64_t{501}));
+    EXPECT_EQ(*stored.find(kBTHMetadataIdentifierKey), Value("com.example.app"));
+    EXPECT_EQ(*stored.find(kBTHMetadataInfoKey), info);
+    EXPECT_EQ(*stored.find(kBTHMetadataUserManagedAssetsDirNameKey), Value("Assets"));
+
+    // Without info and assets name those keys are left out, not written empty.
+    BTHMetadata bare(33, kUuid, 1, "com.example.app", std::nullopt, url, std::nullopt);
+    ASSERT_TRUE(bare.writeMetadataToDisk(nullptr));
+    stored = storedFile(url);
+    EXPECT_EQ(stored.size(), 4u);
+    EXPECT_EQ(stored.find(kBTHMetadataInfoKey), nullptr);
+    EXPECT_EQ(stored.find(kBTHMetadataUserManagedAssetsDirNameKey), nullptr);
+    read = BTHMetadata::readAndValidateMetadataAtUrl(url, 33, false, nullptr);
+    ASSERT_NE(read, nullptr);
+    EXPECT_EQ(*read, bare);
+}
+
+TEST_F(BTHMetadataTest, EachInvalidKeyFailsWithItsOwnMessage) {
+    const fs::path url = makeContainer("Data/Application");
+    const std::string at = " at " + url.string();
+    struct Case {
+        const char* key;
+        Value value;  // null: the key is removed
+        std::string message;
+    };
+    const Case cases[] = {
+        {kBTHMetadataIdentifierKey, Value(), "Invalid metadata Identifier: (null)" + at},
+        {kBTHMetadataIdentifierKey, Value(int64_t{7}), "Invalid metadata Identifier: 7" + at},
+        {kBTHMetadataUUIDKey, Value(), "Invalid metadata UUID String: (null)" + at},
+        {kBTHMetadataUUIDKey, Value("1B4E28BA2FA111D2883F0016D3CCA427"),
+         "Invalid metadata UUID: (null)" + at},
+        {kBTHMetadataContentClassKey, Value("2"), "Invalid metadata Class: 2" + at},
+        {kBTHMetadataContentClassKey, Value(true), "Invalid metadata Class: 1" + at},
+        {kBTHMetadataContentClassKey, Value(uint64_t{0}), "Invalid metadata Content Class: 0" + at},
+        {kBTHMetadataContentClassKey, Value(uint64_t{14}),
+         "Invalid metadata Content Class: 14" + at},
+        {kBTHMetadataContentClassKey, Value(int64_t{-1}),
+         "Invalid metadata Content Class: -1" + at},
+        {kBTHMetadataPersonaKey, Value(uint64_t{502}),
+         "Incorrect UserId: 502, expecting: 501 for com.example.app" + at},
+        {kBTHMetadataPersonaKey, Value("501"),
+         "Incorrect UserId: 501, expecting: 501 for com.example.app" + at},
+        // Not read modulo 2^32.
+        {kBTHMetadataPersonaKey, Value(uint64_t{0x100000000} + 501),
+         "Incorrect UserId: 4294967797, expecting: 501 for com.example.app" + at},
+        {kBTHMetadataInfoKey, Value("x"), "Invalid metadata Info: x" + at},
+        {kBTHMetadataUserManagedAssetsDirNameKey, Value(int64_t{5}),
+         "Invalid metadata User Managed Dir Name String: 5" + at},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.message);
+        Value dict = validFile();
+        if (c.value.isNull())
+            dict.erase(c.key);
+        else
+            dict.set(c.key, c.value);
+        writeFile(url, dict);
+        expectReadFailure(url, 501, true, BTHErrorMetadataInvalid, c.message);
+    }
+}
+
+TEST_F(BTHMetadataTest, AFileWrongInSeveralWaysReportsTheEarliestCheck) {
+    // Placed in the wrong class directory as well, so every check fails.
+    const fs::path url = makeContainer("Data/SprocketPlugin");
+    const std::string at = " at " + url.string();
+    struct Step {
+        const char* key;
+        Value bad;
+        Value good;
+        std::string message;
+    };
+    const Step steps[] = {
+        {kBTHMetadataIdentifierKey, Value(int64_t{1}), Value("com.example.app"),
+         "Invalid metadata Identifier: 1" + at},
+        {kBTHMetadataUUIDKey, Value(int64_t{2}), Value(kUuid.string()),
+         "Invalid metadata UUID String: 2" + at},
+        {kBTHMetadataContentClassKey, Value("c"), Value(uint64_t{2}),
+         "Invalid metadata Class: c" + at},
+        {kBTHMetadataPersonaKey, Value(uint64_t{7}), Value(uint64_t{501}),
+         "Incorrect UserId: 7, expecting: 501 for com.example.app" + at},
+        {kBTHMetadataInfoKey, Value(int64_t{3}), Value::dictionary(),
+         "Invalid metadata Info: 3" + at},
+        {kBTHMetadataUserManagedAssetsDirNameKey, Value(int64_t{4}), Value("Assets"),
+         "Invalid metadata User Managed Dir Name String: 4" + at},
+    };
+    Value dict = validFile();
+    for (const Step& s : steps) dict.set(s.key, s.bad);
+    for (const Step& s : steps) {
+        SCOPED_TRACE(s.message);
+        writeFile(url, dict);
+        expectReadFailure(url, 501, true, BTHErrorMetadataInvalid, s.message);
+        dict.set(s.key, s.good);
+    }
+    writeFile(url, dict);
+    expectReadFailure(url, 501, true, BTHErrorMetadataInvalid,
+                      "Invalid metadata-URLs should match: " + url.string() + " : " +
+                          (scratch_.path() / "Containers/Data/Application").string());
+    EXPECT_NE(BTHMetadata::readAndValidateMetadataAtUrl(url, 501, false, nullptr), nullptr);
+}
+
+TEST_F(BTHMetadataTest, UnreadableFilesFailWithTheReadError) {
+    const fs::path url = makeContainer("Data/Application");
+    const std::string message = "Failed to read metadata at URL " + url.string();
+    const fs::path file = BTHMetadata::metadataFileURL(url);
+
+    expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);  // no file
+
+    const std::optional<std::vector<uint8_t>> array =
+        plist::serializeBinary(Value(Value::Array{validFile()}));
+    ASSERT_TRUE(array);
+    test::writeFile(file, std::string(array->begin(), array->end()));
+    expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);
+
+    test::writeFile(file, "bplist00 this is not a property list");
+    expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);
+
+    fs::remove(file);
+    fs::create_directory(file);
+    expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);
+}
+
+TEST_F(BTHMetadataTest, APipeInTheFilesPlaceDoesNotBlockTheReader) {
+    // An app can put a pipe where its container's file belongs; the read must
+    // fail at once rather than wait for a writer. It runs in a child whose
+    // alarm ends it if it blocks, so a stuck reader fails this test instead of
+    // hanging the suite.
+    const fs::path url = makeContainer("Data/Application");
+    ASSERT_EQ(::mkfifo(BTHMetadata::metadataFileURL(url).c_str(), 0644), 0);
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        ::alarm(30);
+        BTHErrorRef error;
+        bool unreadable = !BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, &error) &&
+                          error && error->isBTHError(BTHErrorMetadataReadFailed);
+        ::_exit(unreadable ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_FALSE(WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM)
+        << "the reader blocked opening a pipe";
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+}
+
+TEST_F(BTHMetadataTest, SymbolicLinksAreNeverFollowed) {
+    // A valid file elsewhere, reached through a link in the metadata file's
+    // place or in the container's path, must not be read.
+    const fs::path real = makeContainer("Data/Application");
+    writeFile(real, validFile());
+    ASSERT_NE(BTHMetadata::readAndValidateMetadataAtUrl(real, 501, true, nullptr), nullptr);
+
+    const fs::path linkedFile = makeContainer("Data/Application");
+    fs::create_symlink(BTHMetadata::metadataFileURL(real),
+                       BTHMetadata::metadataFileURL(linkedFile));
+    expectReadFailure(linkedFile, 501, true, BTHErrorMetadataReadFailed,
+                      "Failed to read metadata at URL " + linkedFile.string());
+
+    const fs::path linkedDir = real.parent_path() / Uuid::random().string();
+    fs::create_directory_symlink(real, linkedDir);
+    expectReadFailure(linkedDir, 501, true, BTHErrorMetadataReadFailed,
+                      "Failed to read metadata at URL " + linkedDir.string());
+
+    const fs::path linkedParent = scratch_.path() / "Linked";
+    fs::create_directory_symlink(scratch_.path() / "Containers", linkedParent);
+    const fs::path throughParent = linkedParent / "Data/Application" / real.filename();
+    expectReadFailure(throughParent, 501, true, BTHErrorMetadataReadFailed,
+                      "Failed to read metadata at URL " + throughParent.string());
+}
+
+TEST_F(BTHMetadataTest, AMissingUserIsDefaultedForThisReadOnly) {
+    const fs::path data = makeContainer("Data/Application");
+    Value dict = validFile();
+    dict.erase(kBTHMetadataPersonaKey);
+    writeFile(data, dict);
+    for (uid_t user : {501u, 502u}) {
+        std::shared_ptr<BTHMetadata> read =
+            BTHMetadata::readAndValidateMetadataAtUrl(data, user, true, nullptr);
+        ASSERT_NE(read, nullptr) << user;
+        EXPECT_EQ(read->uid(), user);
+    }
+    EXPECT_EQ(storedFile(data).find(kBTHMetadataPersonaKey), nullptr) << "written back";
+
+    const fs::path bundle = makeContainer("Bundle/Application");
+    dict.set(kBTHMetadataContentClassKey, uint64_t{1});
+    writeFile(bundle, dict);
+    std::shared_ptr<BTHMetadata> read =
+        BTHMetadata::readAndValidateMetadataAtUrl(bundle, 33, true, nullptr);
+    ASSERT_NE(read, nullptr);
+    EXPECT_EQ(read->uid(), 33u);
+
+    dict.set(kBTHMetadataPersonaKey, uint32_t{501});
+    writeFile(bundle, dict);
+    expectReadFailure(
+        bundle, 33, true, BTHErrorMetadataInvalid,
+        "Incorrect UserId: 501, expecting: 33 for com.example.app at " + bundle.string());
+}
+
+TEST_F(BTHMetadataTest, TheClassPathIsComparedAsPathStrings) {
+    const fs::path url = makeContainer("Data/Application");
+    writeFile(url, validFile());
+    // A trailing slash names the same container.
+    fs::path slashed = url.string() + "/";
+    EXPECT_NE(BTHMetadata::readAndValidateMetadataAtUrl(slashed, 501, true, nullptr), nullptr);
+
+    // A container made inside another container is not in a class directory.
+    const fs::path nested = url / Uuid::random().string();
+    fs::create_directory(nested);
+    writeFile(nested, validFile());
+    expectReadFailure(nested, 501, true, BTHErrorMetadataInvalid,
+                      "Invalid metadata-URLs should match: " + nested.string() + " : " +
+                          (scratch_.path() / "Containers/Data/Data/Application").string());
+}
+
+TEST_F(BTHMetadataTest, XMLFilesAreReadLikeBinaryOnes) {
+    const fs::path url = makeContainer("Data/Application");
+    test::writeFile(BTHMetadata::metadataFileURL(url), R"(<?xml version="1.0" encoding="UTF-8"?>
+<!DOCTYPE plist PUBLIC "-//Apple//DTD PLIST 1.0//EN" "http://www.apple.com/DTDs/PropertyList-1.0.dtd">
+<plist version="1.0">
+<dict>
+    <key>BTHMetadataContentClass</key><integer>2</integer>
+    <key>BTHMetadataIdentifier</key><string>com.example.app</string>
+    <key>BTHMetadataInfo</key><dict><key>k</key><array><true/><integer>-4</integer></array></dict>
+    <key>BTHMetadataPersona</key><integer>501</integer>
+    <key>BTHMetadataUUID</key><string>1b4e28ba-2fa1-11d2-883f-0016d3cca427</string>
+    <key>Unknown</key><string>ignored</string>
+</dict>
+</plist>
+)");
+    std::shared_ptr<BTHMetadata> read =
+        BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, nullptr);
+    ASSERT_NE(read, nullptr);
+    Value info = Value::dictionary();
+    info.set("k", Value(Value::Array{Value(true), Value(int64_t{-4})}));
+    EXPECT_EQ(*read, BTHMetadata(501, kUuid, 2, "com.example.app", info, url, std::nullopt));
+}
+
+TEST_F(BTHMetadataTest, AFailedWriteIsReportedAndLeavesNoFile) {
+    const fs::path missing = scratch_.path() / "Containers/Data/Application/Missing";
+    BTHMetadata record(501, kUuid, 2, "com.example.app", std::nullopt, missing, std::nullopt);
+    LogCapture log;
+    BTHErrorRef error;
+    EXPECT_FALSE(record.writeMetadataToDisk(&error));
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->isBTHError(BTHErrorWriteFailed));
+    EXPECT_EQ(error->localizedDescription(),
+              "Failed to write metadata dictionary to URL " + missing.string());
+    EXPECT_EQ(error->functionName(), kWriteName);
+    ASSERT_NE(error->underlyingError(), nullptr);
+    EXPECT_TRUE(error->underlyingError()->isPOSIXError(ENOENT));
+    EXPECT_EQ(log.count(BTHLogLevelError, "Failed to write metadata dictionary to URL"), 1u);
+    EXPECT_FALSE(fs::exists(missing));
+
+    // A record that cannot be serialised keeps the old file whole.
+    const fs::path url = makeContainer("Data/Application");
+    record.setUrl(url);
+    ASSERT_TRUE(record.writeMetadataToDisk(nullptr));
+    Value info = Value::dictionary();
+    info.set("id", Uuid::random());
+    record.setInfo(info);
+    error.reset();
+    EXPECT_FALSE(record.writeMetadataToDisk(&error));
+    ASSERT_NE(error, nullptr);
+    EXPECT_TRUE(error->isBTHError(BTHErrorWriteFailed));
+    EXPECT_NE(error->underlyingError(), nullptr);
+    EXPECT_EQ(storedFile(url), validFile());
+    EXPECT_EQ(std::distance(fs::directory_iterator(url), fs::directory_iterator()), 1);
+}
+
+TEST_F(BTHMetadataTest, DescriptionNamesTheContainer) {
+    BTHMetadata record(501, kUuid, 4, "com.example.plugin", std::nullopt, "/c/Data/X", "Assets");
+    record.setTransient(true);
+    const std::string text = record.description();
+    for (const char* part :
+         {"uid: 501", "Data/SprocketPlugin", "com.example.plugin",
+          "1B4E28BA-2FA1-11D2-883F-0016D3CCA427", "/c/Data/X", "transient: 1", "Assets"})
+        EXPECT_NE(text.find(part), std::string::npos) << part << " in " << text;
+    EXPECT_EQ(text.find('\n'), std::string::npos);
+}
+
+}  // namespace
+}  // namespace berth
