@@ -92,6 +92,35 @@ class SyncItem {
     const ThreadContext* caller_;
 };
 
+}  // namespace
+
+// The work a queue hands to its target for its pending items: a drain of a
+// serial queue, or one runner of a concurrent queue. If the target drops it
+// unrun (its executor has shut down), the queue can never run what is
+// pending, and drops that too.
+class WorkQueue::ScheduledWork {
+  public:
+    ScheduledWork(std::shared_ptr<WorkQueue> queue, void (WorkQueue::*run)())
+        : queue_(std::move(queue)), run_(run) {}
+    ScheduledWork(ScheduledWork&& other) noexcept
+        : queue_(std::move(other.queue_)), run_(other.run_) {}
+    ScheduledWork& operator=(ScheduledWork&&) = delete;
+    ~ScheduledWork() {
+        if (queue_) queue_->abandonScheduledWork();
+    }
+
+    void operator()() {
+        const std::shared_ptr<WorkQueue> queue = std::move(queue_);
+        ((*queue).*run_)();
+    }
+
+  private:
+    std::shared_ptr<WorkQueue> queue_;
+    void (WorkQueue::*run_)();
+};
+
+namespace {
+
 template <class T>
 bool contains(const std::vector<T>& items, const T& item) {
     return std::find(items.begin(), items.end(), item) != items.end();
@@ -179,7 +208,8 @@ void WorkQueue::schedule(std::unique_lock<std::mutex> lock) {
         if (draining_ || pending_.empty()) return;
         draining_ = true;
         lock.unlock();
-        submitTo(target, executor_.get(), [self = shared_from_this()] { self->drainSerial(); });
+        submitTo(target, executor_.get(),
+                 ScheduledWork(shared_from_this(), &WorkQueue::drainSerial));
         return;
     }
     size_t runners = pending_.size() > scheduledRunners_ ? pending_.size() - scheduledRunners_ : 0;
@@ -207,7 +237,7 @@ void WorkQueue::drainSerial() {
                 const std::shared_ptr<WorkQueue> target = target_;
                 lock.unlock();
                 submitTo(target, executor_.get(),
-                         [self = shared_from_this()] { self->drainSerial(); });
+                         ScheduledWork(shared_from_this(), &WorkQueue::drainSerial));
                 return;
             }
             item = std::move(pending_.front());
@@ -228,6 +258,18 @@ void WorkQueue::runOneConcurrent() {
     }
     RunningFrame frame(this);
     runItem(item);
+}
+
+void WorkQueue::abandonScheduledWork() {
+    std::deque<WorkItem> dropped;
+    std::lock_guard lock(mutex_);
+    if (kind_ == Kind::serial) {
+        draining_ = false;
+    } else {
+        --scheduledRunners_;
+    }
+    dropped.swap(pending_);
+    // `dropped` goes after the lock is released (declared before it).
 }
 
 void WorkQueue::suspend() {

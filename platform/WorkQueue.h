@@ -33,7 +33,9 @@
 // waiting to run holds its queue: dropping every handle of a queue that has
 // pending items still runs them all, in order, and then frees the queue. Only
 // a queue dropped while suspended destroys its pending items without running
-// them, since nothing could resume it any more.
+// them, since nothing could resume it any more. Work whose executor has shut
+// down (a destroyed run loop, a stopped pool) is destroyed unrun, and a sync
+// waiting for such work ends the process rather than wait forever.
 //
 // Exceptions. An exception that escapes an asynchronous item ends the process
 // through std::terminate (where the daemon's terminate handler reports it).
@@ -120,6 +122,10 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
     void schedule(std::unique_lock<std::mutex> lock);
     void drainSerial();
     void runOneConcurrent();
+    // Called when the target dropped scheduled work unrun.
+    void abandonScheduledWork();
+
+    class ScheduledWork;
 
     const std::string label_;
     const Kind kind_;
