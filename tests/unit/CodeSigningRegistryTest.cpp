@@ -14,6 +14,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <functional>
+#include <memory>
 #include <thread>
 
 #include "TestSupport.h"
@@ -43,8 +44,10 @@ class ScratchDeviceRoot : public ::testing::Environment {
   private:
     std::filesystem::path root_;
 };
-[[maybe_unused]] ::testing::Environment* const kDeviceRoot = ::testing::AddGlobalTestEnvironment(
-    new ScratchDeviceRoot);  // gtest owns and deletes environments
+
+// gtest takes ownership of its environments.
+[[maybe_unused]] ::testing::Environment* const kDeviceRoot =
+    ::testing::AddGlobalTestEnvironment(std::make_unique<ScratchDeviceRoot>().release());
 
 ExecutableId idOf(const std::filesystem::path& path) {
     struct stat status {};
@@ -458,7 +461,7 @@ TEST(DigestCacheTest, ConcurrentLookupsAgree) {
     std::vector<Sha256Digest> expected;
     for (int i = 0; i < 4; ++i) {
         std::string text(1000 + i, static_cast<char>('a' + i));
-        files.push_back(makeFile(dir, "f" + std::to_string(i), text));
+        files.push_back(makeFile(dir, std::string(1, static_cast<char>('0' + i)), text));
         expected.push_back(sha256({reinterpret_cast<const uint8_t*>(text.data()), text.size()}));
     }
     DigestCache cache(2, 0ns);
