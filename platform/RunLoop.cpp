@@ -69,16 +69,6 @@ class RunLoop::Inbox final : public Executor {
         return std::exchange(items_, {});
     }
 
-    // Returns items taken but not run, ahead of anything that came since.
-    void putBack(std::deque<WorkItem> rest) {
-        std::lock_guard lock(mutex_);
-        while (!items_.empty()) {
-            rest.push_back(std::move(items_.front()));
-            items_.pop_front();
-        }
-        items_ = std::move(rest);
-    }
-
     void requestStop() {
         stopRequested_.store(true, std::memory_order_release);
         wake();
@@ -181,18 +171,10 @@ void RunLoop::run() {
     }
 }
 
-bool RunLoop::runInbox() {
-    std::deque<WorkItem> items = inbox_->take();
-    while (!items.empty()) {
-        WorkItem item = std::move(items.front());
-        items.pop_front();
-        item();
-        if (inbox_->wantsYield() && !items.empty()) {
-            inbox_->putBack(std::move(items));
-            return false;
-        }
-    }
-    return true;
+void RunLoop::runInbox() {
+    // The queue's drain yields by itself once a stop is requested, so what
+    // was taken here is run whole.
+    for (WorkItem& item : inbox_->take()) item();
 }
 
 void RunLoop::deliverReadiness(WatchId id) {

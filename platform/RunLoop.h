@@ -72,8 +72,8 @@ class RunLoop {
         std::shared_ptr<std::function<void()>> handler;
     };
 
-    // Runs what the loop's queue handed over; false when asked to stop.
-    bool runInbox();
+    // Runs what the loop's queue handed over.
+    void runInbox();
     void deliverReadiness(WatchId id);
 
     const std::thread::id owner_;

@@ -67,6 +67,16 @@ class Watchdog {
     std::thread thread_;
 };
 
+// A death test whose statement would hang if the fault were not detected:
+// the alarm ends the child then, and the test fails instead of hanging.
+#define EXPECT_DEATH_BOUNDED(statement, regex) \
+    EXPECT_DEATH(                              \
+        {                                      \
+            ::alarm(30);                       \
+            statement;                         \
+        },                                     \
+        regex)
+
 class RunLoopDeathTest : public testing::Test {
   protected:
     void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
@@ -247,13 +257,14 @@ TEST(RunLoopTest, MainRunLoopServesTheMainQueueOnTheMainThread) {
 TEST_F(RunLoopDeathTest, WaitsThatCouldNeverEndEndTheProcess) {
     RunLoop loop;
     // The loop's thread waiting on its own queue, even before it runs.
-    EXPECT_DEATH(loop.queue()->sync([] {}), "runs only on a thread that is waiting for it");
+    EXPECT_DEATH_BOUNDED(loop.queue()->sync([] {}), "runs only on a thread that is waiting for it");
     // ... or through work it waits for on another queue.
     auto queue = WorkQueue::makeSerial("test.helper");
-    EXPECT_DEATH(queue->sync([&] { loop.queue()->sync([] {}); }),
-                 "runs only on a thread that is waiting for it");
+    EXPECT_DEATH_BOUNDED(queue->sync([&] { loop.queue()->sync([] {}); }),
+                         "runs only on a thread that is waiting for it");
     // Only the loop's own thread runs it.
-    EXPECT_DEATH(std::thread([&] { loop.run(); }).join(), "run off the thread that made it");
+    EXPECT_DEATH_BOUNDED(std::thread([&] { loop.run(); }).join(),
+                         "run off the thread that made it");
 }
 
 }  // namespace

@@ -88,6 +88,16 @@ int currentNice() {
     return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)));
 }
 
+// A death test whose statement would hang if the fault were not detected:
+// the alarm ends the child then, and the test fails instead of hanging.
+#define EXPECT_DEATH_BOUNDED(statement, regex) \
+    EXPECT_DEATH(                              \
+        {                                      \
+            ::alarm(30);                       \
+            statement;                         \
+        },                                     \
+        regex)
+
 class WorkQueueDeathTest : public testing::Test {
   protected:
     void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
@@ -224,18 +234,21 @@ TEST(WorkQueueTest, ItemRunningWhenSuspendedFinishesAndTheNextWaits) {
 
 TEST(WorkQueueTest, ItemMaySuspendItsOwnQueueToHoldBackLaterWork) {
     // The lock-state callback's pattern: suspend from work on a queue and
-    // resume later from elsewhere.
+    // resume later from elsewhere. Everything is queued before it runs, so
+    // the later item is pending when the earlier one suspends.
     auto queue = WorkQueue::makeSerial("test.lockstate");
+    Event submitted, secondRan;
     std::vector<int> order;
+    queue->async([&] { submitted.wait(); });
     queue->async([&] {
         order.push_back(1);
         queue->suspend();
     });
-    Event secondRan;
     queue->async([&] {
         order.push_back(2);
         secondRan.set();
     });
+    submitted.set();
     giveChanceToMisbehave();
     EXPECT_FALSE(secondRan.isSet());
     queue->resume();
@@ -478,28 +491,30 @@ TEST(ThreadPoolTest, WorkersTakeTheirPoolsPriorityWhoeverStartsThem) {
 
 TEST_F(WorkQueueDeathTest, SyncThatCouldNeverFinishEndsTheProcessWithAMessage) {
     auto queue = WorkQueue::makeSerial("test.self");
-    EXPECT_DEATH(queue->sync([&] { queue->sync([] {}); }),
-                 "sync onto queue \"test.self\" would never finish");
+    EXPECT_DEATH_BOUNDED(queue->sync([&] { queue->sync([] {}); }),
+                         "sync onto queue \"test.self\" would never finish");
 
     auto target = WorkQueue::makeSerial("test.target.queue");
     auto child = WorkQueue::makeSerial("test.child");
     child->setTarget(target);
     // From work of the child onto its target, and from the target's own work
     // onto a queue whose work must run on it.
-    EXPECT_DEATH(child->sync([&] { target->sync([] {}); }), "serial queue \"test.target.queue\"");
-    EXPECT_DEATH(target->sync([&] { child->sync([] {}); }), "serial queue \"test.target.queue\"");
+    EXPECT_DEATH_BOUNDED(child->sync([&] { target->sync([] {}); }),
+                         "serial queue \"test.target.queue\"");
+    EXPECT_DEATH_BOUNDED(target->sync([&] { child->sync([] {}); }),
+                         "serial queue \"test.target.queue\"");
 
     // Through a sync made on behalf of a caller that waits on the first queue.
     auto other = WorkQueue::makeSerial("test.other");
-    EXPECT_DEATH(queue->sync([&] { other->sync([&] { queue->sync([] {}); }); }),
-                 "sync onto queue \"test.self\" would never finish");
+    EXPECT_DEATH_BOUNDED(queue->sync([&] { other->sync([&] { queue->sync([] {}); }); }),
+                         "sync onto queue \"test.self\" would never finish");
 }
 
 TEST_F(WorkQueueDeathTest, MisuseOfSuspensionAndTargetsEndsTheProcess) {
     auto queue = WorkQueue::makeSerial("test.misuse");
     queue->suspend();
     queue->resume();
-    EXPECT_DEATH(queue->resume(), "resumed more often than it was suspended");
+    EXPECT_DEATH_BOUNDED(queue->resume(), "resumed more often than it was suspended");
     EXPECT_DEATH(WorkQueue::global(QueuePriority::normal)->suspend(), "cannot be suspended");
 
     auto a = WorkQueue::makeSerial("test.a");
