@@ -28,6 +28,8 @@ inline constexpr std::string_view kBTHPOSIXErrorDomain = "POSIXErrorDomain";
 // The generic domain of the property-list reader's "not a dictionary" error.
 inline constexpr std::string_view kBTHGeneralErrorDomain = "GeneralErrorDomain";
 inline constexpr int32_t kBTHPropertyListReadCorruptError = 2048;
+// ... and of a value that has no property-list form.
+inline constexpr int32_t kBTHPropertyListWriteInvalidError = 3851;
 
 inline constexpr const char* kBTHLocalizedDescriptionKey = "LocalizedDescription";
 inline constexpr const char* kBTHUnderlyingErrorKey = "UnderlyingError";

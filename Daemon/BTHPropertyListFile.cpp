@@ -61,7 +61,7 @@ bool BTH_writeToURL(const Value& dictionary, const std::filesystem::path& url, u
     std::optional<std::vector<uint8_t>> bytes = plist::serializeBinary(dictionary, &why);
     if (!bytes) {
         BTHSetError(error, BTHCreateError(bthFunctionName, __LINE__, kBTHGeneralErrorDomain,
-                                          kBTHPropertyListReadCorruptError, nullptr, nullptr, 0,
+                                          kBTHPropertyListWriteInvalidError, nullptr, nullptr, 0,
                                           "Property list invalid for format: %@", why));
         return false;
     }
@@ -81,7 +81,8 @@ std::optional<Value> BTH_dictionaryWithContentsOfURL(const std::filesystem::path
                                                      uint32_t options, BTHErrorRef* error) {
     BTH_FUNCTION("BTH_dictionaryWithContentsOfURL:options:error:");
     static const plist::Limits limits;
-    UniqueFd fd = fs::openNoFollow(url, O_RDONLY);
+    // Non-blocking: an app may leave a FIFO where a state file should be.
+    UniqueFd fd = fs::openNoFollow(url, O_RDONLY | O_NONBLOCK);
     struct stat st;
     if (!fd || ::fstat(fd.get(), &st) != 0) {
         int errnum = errno;

@@ -155,7 +155,12 @@ TEST(BTHPropertyListFileTest, ReadGivesTheReadErrorOrTheFormatError) {
         UniqueFd big(::open((dir / "big.plist").c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
         ASSERT_EQ(::ftruncate(big.get(), 33 << 20), 0);  // sparse; refused before reading
     }
-    for (const char* name : {"deep.plist", "array.plist", "garbage.plist", "big.plist"}) {
+    // An app may leave a FIFO (or a directory) where a state file should be:
+    // refused at once, never waited on.
+    ASSERT_EQ(::mkfifo((dir / "fifo.plist").c_str(), 0644), 0);
+    stdfs::create_directory(dir / "dir.plist");
+    for (const char* name :
+         {"deep.plist", "array.plist", "garbage.plist", "big.plist", "fifo.plist", "dir.plist"}) {
         error.reset();
         EXPECT_FALSE(read(dir / name, &error)) << name;
         EXPECT_TRUE(isGeneralCorrupt(error))
