@@ -1,9 +1,11 @@
 #include "BTHError.h"
 
+#include <cxxabi.h>
 #include <execinfo.h>
 
 #include <atomic>
 #include <cstring>
+#include <typeinfo>
 
 #include "platform/DeviceProperties.h"
 
@@ -78,18 +80,14 @@ BTHErrorRef BTHCreatePOSIXErrorv(const char* function, int line, int errnum,
 
 namespace {
 
-std::string exceptionText(const std::exception_ptr& e) {
-    try {
-        if (e) std::rethrow_exception(e);
-    } catch (const std::exception& caught) {
-        return caught.what();
-    } catch (...) {
-        return "unknown exception";
-    }
-    return "(null)";
+std::string demangledName(const char* mangled) {
+    int status = 0;
+    std::unique_ptr<char, decltype(&free)> name(
+        abi::__cxa_demangle(mangled, nullptr, nullptr, &status), &free);
+    return status == 0 && name ? name.get() : mangled;
 }
 
-Value callStackSymbols() {
+Value currentCallStack() {
     void* frames[64];
     int count = backtrace(frames, 64);
     Value symbols = Value::array();
@@ -106,18 +104,35 @@ std::atomic<BTHExceptionReporter>& reporterSlot() {
 
 }  // namespace
 
-BTHErrorRef BTHCreateExceptionError(const char* function, int line, const std::exception_ptr& e) {
+BTHCaughtException BTHCaughtException::from(const std::exception_ptr& e) {
+    BTHCaughtException caught;
+    caught.callStackSymbols = currentCallStack();
+    try {
+        if (e) std::rethrow_exception(e);
+    } catch (const std::exception& thrown) {
+        caught.name = demangledName(typeid(thrown).name());
+        caught.reason = thrown.what();
+    } catch (...) {
+        if (const std::type_info* type = abi::__cxa_current_exception_type())
+            caught.name = demangledName(type->name());
+        caught.reason = "unknown exception";
+    }
+    return caught;
+}
+
+BTHErrorRef BTHCreateExceptionError(const char* function, int line,
+                                    const BTHCaughtException& exception) {
     return BTHCreateError(function, line, kBTHErrorDomain, BTHErrorException, nullptr, nullptr, 1,
-                          "Got exception: %@ : %@", exceptionText(e), callStackSymbols());
+                          "Got exception: %@ : %@", exception.reason, exception.callStackSymbols);
 }
 
 void BTHSetExceptionReporter(BTHExceptionReporter reporter) {
     reporterSlot().store(reporter);
 }
 
-void BTHReportCaughtException(const BTHErrorRef& error) {
+void BTHReportCaughtException(const BTHCaughtException& exception) {
     if (!DeviceProperties::isInternalBuild()) return;
-    if (BTHExceptionReporter reporter = reporterSlot().load()) reporter(error);
+    if (BTHExceptionReporter reporter = reporterSlot().load()) reporter(exception);
 }
 
 }  // namespace berth

@@ -124,17 +124,29 @@ inline void BTHSetErrorCode(uint64_t* out, uint64_t code) {
     if (out) *out = code;
 }
 
-// The error of the exception rule: code 40, "Got exception: %@ : %@" with the
-// exception's text and the call stack at the point it was caught, logged
-// under `function`.
-BTHErrorRef BTHCreateExceptionError(const char* function, int line, const std::exception_ptr& e);
+// An exception caught at an operation's boundary, as the exception rule
+// reports it: its type name, its text, and the call stack where it was
+// caught.
+struct BTHCaughtException {
+    std::string name;
+    std::string reason;
+    Value callStackSymbols = Value::array();
 
-// The hook the exception rule calls after making its error: on internal
-// builds it ends the process through the uncaught-exception reporter. Start-up
-// installs the reporter; until then (and in tests) it does nothing.
-using BTHExceptionReporter = void (*)(const BTHErrorRef& error);
+    static BTHCaughtException from(const std::exception_ptr& e);
+    std::string description() const { return reason; }
+};
+
+// The error of the exception rule: code 40, "Got exception: %@ : %@" with the
+// exception's text and its call stack, logged under `function`.
+BTHErrorRef BTHCreateExceptionError(const char* function, int line,
+                                    const BTHCaughtException& exception);
+
+// The rest of the exception rule, after its error is made: on internal builds
+// the uncaught-exception reporter ends the process. Start-up installs the
+// reporter; until then (and in tests) nothing happens.
+using BTHExceptionReporter = void (*)(const BTHCaughtException& exception);
 void BTHSetExceptionReporter(BTHExceptionReporter reporter);
-void BTHReportCaughtException(const BTHErrorRef& error);
+void BTHReportCaughtException(const BTHCaughtException& exception);
 
 }  // namespace berth
 

@@ -67,11 +67,16 @@ TEST(BTHErrorTest, POSIXErrorsCarryExactlyThreeKeysAndNeverLog) {
 TEST(BTHErrorTest, ExceptionErrorIsCode40WithTextAndCallStack) {
     LogCapture log;
     BTHErrorRef e;
+    BTHCaughtException caught;
     try {
         throw std::runtime_error("boom");
     } catch (...) {
-        e = BTHCreateExceptionError("-[BTHContainerCache op]", 300, std::current_exception());
+        caught = BTHCaughtException::from(std::current_exception());
+        e = BTHCreateExceptionError("-[BTHContainerCache op]", 300, caught);
     }
+    EXPECT_EQ(caught.name, "std::runtime_error");
+    EXPECT_EQ(caught.reason, "boom");
+    EXPECT_GT(caught.callStackSymbols.size(), 0u);
     EXPECT_TRUE(e->isBTHError(BTHErrorException));
     EXPECT_EQ(e->localizedDescription().rfind("Got exception: boom : (", 0), 0u);
     auto lines = log.lines();
