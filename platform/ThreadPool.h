@@ -3,10 +3,14 @@
 // A `ThreadPool` runs submitted work items in submission order on worker
 // threads that it starts on demand. Daemon handlers may block for a long time
 // (waiting for an identifier lock, for the termination service, for a disk),
-// so the pool never lets waiting work sit behind blocked workers: whenever an
-// item is waiting and no worker is idle to take it, a new worker is started,
-// up to a high cap. Workers that stay idle for a while exit again, so a burst
-// of blocked handlers does not leave threads behind.
+// so the pool never lets waiting work sit behind blocked workers. When an item
+// arrives and no worker is idle to take it, a worker is started at once while
+// there are fewer than a few per core; beyond that, any item that has waited
+// a short while (busy workers that do not come back are taken to be blocked)
+// gets a new worker, up to a high cap. A burst of short items is thus served
+// by the workers there are, and blocked handlers never hold up other work for
+// more than that short while. Workers that stay idle for a while exit again,
+// so a burst of blocked handlers does not leave threads behind.
 //
 // Two process-wide pools exist, one per priority (`ThreadPool::shared`). The
 // workers of the background pool lower their own CPU and I/O priority, so
@@ -90,6 +94,11 @@ class ThreadPool final : public Executor {
         std::string name = "berth-pool";
         // Upper bound of live workers; items wait when it is reached.
         size_t maxThreads = 512;
+        // Workers started as soon as an item finds no idle worker.
+        size_t immediateThreads = 8;
+        // Beyond `immediateThreads`, an item that has waited this long gets
+        // a new worker.
+        std::chrono::milliseconds stallThreshold{10};
         // A worker idle for this long exits.
         std::chrono::milliseconds idleTimeout = std::chrono::seconds(10);
         // Workers run at the niceness of the thread that made the pool plus
@@ -121,8 +130,6 @@ class ThreadPool final : public Executor {
 
   private:
     struct State;
-    static void workerMain(std::shared_ptr<State> state, size_t number);
-    void startWorkerLocked();
 
     // Shared with the workers, so that it outlives a pool dropped by one of
     // its own workers.

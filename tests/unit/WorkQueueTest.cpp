@@ -423,6 +423,37 @@ TEST(ThreadPoolTest, GrowsWhileWorkWaitsUpToItsCapAndIdleWorkersExit) {
     EXPECT_TRUE(ranAgain.wait());
 }
 
+TEST(ThreadPoolTest, BurstOfShortItemsIsServedByTheWorkersThereAre) {
+    // A stall threshold never reached: only the immediate workers exist.
+    ThreadPool pool({.name = "test-burst", .immediateThreads = 2, .stallThreshold = 1h});
+    std::atomic<int> ran{0};
+    for (int i = 0; i < 1000; ++i) pool.execute([&] { ++ran; });
+    EXPECT_TRUE(eventually([&] { return ran.load() == 1000; }));
+    EXPECT_LE(pool.threadCount(), 2u);
+}
+
+TEST(ThreadPoolTest, ItemsWaitingBehindBlockedWorkersGetNewWorkers) {
+    ThreadPool pool(
+        {.name = "test-stall", .maxThreads = 16, .immediateThreads = 1, .stallThreshold = 20ms});
+    Event release;
+    std::atomic<int> started{0};
+    for (int i = 0; i < 6; ++i) {
+        pool.execute([&] {
+            ++started;
+            release.wait();
+        });
+    }
+    EXPECT_TRUE(eventually([&] { return started.load() == 6; }))
+        << "only " << started.load() << " blocked items started";
+    // Later work is not held up either, once no spare worker is left and the
+    // monitor has nothing to watch.
+    EXPECT_TRUE(eventually([&] { return pool.threadCount() == 6 && pool.idleThreadCount() == 0; }));
+    Event later;
+    pool.execute([&] { later.set(); });
+    EXPECT_TRUE(later.wait());
+    release.set();
+}
+
 TEST(ThreadPoolTest, StoppingWaitsForRunningItemsAndDropsWaitingOnes) {
     auto pool =
         std::make_unique<ThreadPool>(ThreadPool::Options{.name = "test-stop", .maxThreads = 1});
