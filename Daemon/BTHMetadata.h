@@ -20,7 +20,8 @@
 //
 // The file lives in a directory the container's app owns, so its content is
 // untrusted: the reader opens it with no symbolic link followed anywhere in
-// its path and validates every key before believing any of it.
+// its path below the device root, refuses anything but a regular file, and
+// validates every key before believing any of it.
 //
 // A record is a plain value; it is not shared between threads while being
 // changed. The file is replaced atomically, so a concurrent reader sees the
