@@ -1,0 +1,65 @@
+#include "BTHCommandTable.h"
+
+#include "BTHError.h"
+
+namespace berth {
+
+namespace {
+
+// The handler of commands whose operation has not been built into this
+// daemon yet: the caller learns the command is not available.
+void commandNotAvailable(const BTHRequestRef&, const std::shared_ptr<BTHClientConnection>&,
+                         uint64_t* replyError) {
+    BTHSetErrorCode(replyError, BTHErrorInvalidCommand);
+}
+
+constexpr BTHCommandRow row(uint64_t command, const char* name, const char* entitlement,
+                            uint32_t repliesAtOnce = 1,
+                            BTHCommandHandler handler = commandNotAvailable) {
+    return BTHCommandRow{command, name, handler, entitlement, repliesAtOnce, 0};
+}
+
+}  // namespace
+
+const std::array<BTHCommandRow, kBTHCommandCount>& BTHCommandTable() {
+    static const std::array<BTHCommandRow, kBTHCommandCount> table{{
+        row(0, "createOrLookupContainer", kBTHEntitlementNone),
+        row(1, "listContainers", kBTHEntitlementAllowed),
+        row(2, "replaceContainer", kBTHEntitlementAllowed),
+        row(3, "stageContainerForDelete", kBTHEntitlementAllowed),
+        row(4, "deleteContainersOnDeathRow", kBTHEntitlementAllowed, 0),
+        row(5, "setInfoValue", kBTHEntitlementAllowed),
+        row(6, "getInfoValue", kBTHEntitlementAllowed),
+        row(7, "getContainerMetadata", kBTHEntitlementAllowed),
+        row(8, "recreateDefaultStructure", kBTHEntitlementAllowed),
+        row(9, "regenerateDirectoryUUID", kBTHEntitlementAllowed),
+        row(10, "deleteContainer", kBTHEntitlementAllowed),
+        row(11, "wipePluginDataContainer", kBTHEntitlementWipeContainer),
+        row(12, "wipeDataContainer", kBTHEntitlementAllowed),
+        row(13, "groupContainerPaths", kBTHEntitlementNone),
+        row(14, "groupContainerIdentifiers", kBTHEntitlementAllowed),
+        row(15, "systemContainerPath", kBTHEntitlementNone),
+        row(16, "systemGroupContainerPaths", kBTHEntitlementNone),
+        row(17, "systemGroupContainerPath", kBTHEntitlementNone),
+        row(18, "processCodeSigningInfo", kBTHEntitlementAllowed),
+        row(19, "getCodeSigningInfo", kBTHEntitlementAllowed),
+        row(20, "invalidateCodeSigningInfo", kBTHEntitlementAllowed),
+        row(21, "setDataProtection", kBTHEntitlementAllowed, 0),
+        row(22, "recreateDefaultStructure", kBTHEntitlementAllowed),
+        row(23, "diskUsage", kBTHEntitlementAllowed),
+        row(24, "performDataMigration", kBTHEntitlementDataMigration),
+        row(25, "retryTest", kBTHEntitlementAllowed),
+        row(26, "stageSharedContent", kBTHEntitlementStageSharedContent),
+        row(27, "setNetworkExtension", kBTHEntitlementNetworkExtension),
+        row(28, "userManagedAssetsPath", kBTHEntitlementUserManagedAssets),
+        row(29, "deleteUserManagedAsset", kBTHEntitlementUserManagedAssets),
+    }};
+    return table;
+}
+
+void BTHSendAsynchronousReply(const BTHRequestRef& request, uint64_t code) {
+    request->reply().set("ReplyError", code);
+    request->sendReply();
+}
+
+}  // namespace berth

@@ -1,0 +1,189 @@
+#include "BTHRequestIntake.h"
+
+#include <gtest/gtest.h>
+
+#include "BTHCommandTable.h"
+#include "BTHError.h"
+#include "ScratchDeviceRoot.h"
+#include "TestSupport.h"
+
+namespace berth {
+namespace {
+
+const bool kRoot = !test::installScratchDeviceRoot().empty();
+
+class FakeRequest final : public BTHRequest {
+  public:
+    FakeRequest(Value message, BTHPeerIdentity peer)
+        : message_(std::move(message)), peer_(std::move(peer)) {}
+    const Value& message() const override { return message_; }
+    Value& reply() override { return reply_; }
+    const BTHPeerIdentity& peer() const override { return peer_; }
+    void sendReply() override { ++sent; }
+
+    int sent = 0;
+
+  private:
+    Value message_;
+    Value reply_ = Value::dictionary();
+    BTHPeerIdentity peer_;
+};
+
+BTHPeerIdentity peerWith(std::optional<Value> entitlements, uid_t uid = 501) {
+    BTHPeerIdentity peer;
+    peer.pid = 4242;
+    peer.effectiveUserId = uid;
+    peer.signingIdentifier = "sys.kelp.tester";
+    peer.entitlements = std::move(entitlements);
+    return peer;
+}
+
+Value entitlements(std::initializer_list<std::pair<const char*, Value>> entries) {
+    Value d = Value::dictionary();
+    for (auto& [k, v] : entries) d.set(k, v);
+    return d;
+}
+
+// The reply error of `command` sent by `peer`, and how many replies went out.
+std::pair<uint64_t, int> run(const Value& message, const BTHPeerIdentity& peer) {
+    auto request = std::make_shared<FakeRequest>(message, peer);
+    BTHProcessRequest(request);
+    const Value* error = request->reply().find("ReplyError");
+    return {error ? *error->uint64Value() : 0, request->sent};
+}
+
+Value command(uint64_t n) {
+    Value m = Value::dictionary();
+    m.set("Command", n);
+    return m;
+}
+
+// Commands that pass the entitlement check reach their handler, which in
+// this build answers 49 for every command; refused ones get 55.
+constexpr uint64_t kReachedHandler = BTHErrorInvalidCommand;
+
+TEST(BTHRequestIntakeTest, CallerWithoutEntitlementsReachesOnlyOpenCommands) {
+    test::LogCapture log;
+    const auto peer = peerWith(std::nullopt);
+    for (uint64_t c = 0; c < kBTHCommandCount; ++c) {
+        bool open = c == 0 || c == 13 || c == 15 || c == 16 || c == 17;
+        EXPECT_EQ(run(command(c), peer).first, open ? kReachedHandler : BTHErrorNotEntitled) << c;
+    }
+    EXPECT_TRUE(log.contains(3,
+                             "connection attempt from pid 4242 (sys.kelp.tester) missing "
+                             "required entitlement: sys.kelp.private.Berth.allowed"));
+}
+
+TEST(BTHRequestIntakeTest, AllowedPassesEveryCommandAndOtherIdLookupOnlyTheOpenOnes) {
+    const auto allowed = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    for (uint64_t c = 0; c < kBTHCommandCount; ++c)
+        EXPECT_EQ(run(command(c), allowed).first, kReachedHandler) << c;
+
+    const auto lookupOnly = peerWith(entitlements({{kBTHEntitlementOtherIdLookup, true}}));
+    EXPECT_EQ(run(command(0), lookupOnly).first, kReachedHandler);
+    EXPECT_EQ(run(command(1), lookupOnly).first, BTHErrorNotEntitled);
+    EXPECT_EQ(run(command(24), lookupOnly).first, BTHErrorNotEntitled);
+
+    auto client = checkEntitlementsAndInitClientObject(lookupOnly, kBTHEntitlementNone);
+    ASSERT_TRUE(client);
+    EXPECT_TRUE(client->allowOtherIdLookup());
+    client = checkEntitlementsAndInitClientObject(peerWith(std::nullopt), kBTHEntitlementNone);
+    ASSERT_TRUE(client);
+    EXPECT_FALSE(client->allowOtherIdLookup());
+    EXPECT_EQ(client->clientUserId(), 501u);
+    EXPECT_EQ(client->clientBundleIdentifier(), "sys.kelp.tester");
+}
+
+TEST(BTHRequestIntakeTest, SpecificEntitlementsAndTheWipeList) {
+    const auto migrator = peerWith(entitlements({{kBTHEntitlementDataMigration, true}}));
+    EXPECT_EQ(run(command(24), migrator).first, kReachedHandler);
+    EXPECT_EQ(run(command(26), migrator).first, BTHErrorNotEntitled);
+    const auto falseValue = peerWith(entitlements({{kBTHEntitlementDataMigration, false}}));
+    EXPECT_EQ(run(command(24), falseValue).first, BTHErrorNotEntitled);
+
+    test::LogCapture log;
+    Value ids = Value::array();
+    ids.push("sys.kelp.plugin.a");
+    ids.push(7);  // not a string: not an identifier
+    auto wiper = peerWith(entitlements({{kBTHEntitlementWipeContainer, ids}}));
+    auto client = checkEntitlementsAndInitClientObject(wiper, kBTHEntitlementWipeContainer);
+    ASSERT_TRUE(client);
+    EXPECT_EQ(client->entitledWipeIdentifiers(), std::vector<std::string>{"sys.kelp.plugin.a"});
+    EXPECT_FALSE(client->allowOtherIdLookup());
+
+    auto notArray = peerWith(entitlements({{kBTHEntitlementWipeContainer, true}}));
+    EXPECT_FALSE(checkEntitlementsAndInitClientObject(notArray, kBTHEntitlementWipeContainer));
+    EXPECT_TRUE(log.contains(3, "No entitled containers to wipe"));
+
+    // ".allowed" passes the wipe command too, with no wipe identifiers.
+    auto allowedOnly = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    client = checkEntitlementsAndInitClientObject(allowedOnly, kBTHEntitlementWipeContainer);
+    ASSERT_TRUE(client);
+    EXPECT_FALSE(client->entitledWipeIdentifiers());
+}
+
+TEST(BTHRequestIntakeTest, CommandNumberChecks) {
+    test::LogCapture log;
+    const auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    EXPECT_EQ(run(command(30), peer), std::make_pair(uint64_t{BTHErrorInvalidCommand}, 1));
+    EXPECT_EQ(run(command((uint64_t{1} << 32) + 1), peer).first, BTHErrorInvalidCommand);
+    EXPECT_EQ(run(command(UINT64_MAX), peer).first, BTHErrorInvalidCommand);
+    EXPECT_TRUE(log.contains(3, "Invalid command index: 30"));
+    EXPECT_TRUE(log.contains(3, "Invalid command index: -1"));
+    // No "Command" at all reads as command 0, open to every caller.
+    EXPECT_EQ(run(Value::dictionary(), peerWith(std::nullopt)).first, kReachedHandler);
+}
+
+TEST(BTHRequestIntakeTest, RequestsFromAProcessNoLongerBoundAreRefused) {
+    auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    peer.processStillBound = false;
+    EXPECT_EQ(run(command(0), peer), std::make_pair(uint64_t{BTHErrorNotEntitled}, 1));
+}
+
+TEST(BTHRequestIntakeTest, AsynchronousCommandsReplyOnceFromWhicheverSideFinishes) {
+    // The handler of command 4 fails at once in this build: the processor
+    // sends the one reply itself.
+    const auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    EXPECT_EQ(run(command(4), peer), std::make_pair(uint64_t{BTHErrorInvalidCommand}, 1));
+    auto request = std::make_shared<FakeRequest>(command(21), peer);
+    BTHSendAsynchronousReply(request, 61);
+    EXPECT_EQ(request->sent, 1);
+    EXPECT_EQ(*request->reply().find("ReplyError"), Value(61));
+}
+
+TEST(BTHRequestIntakeTest, ValidateUserIdForEveryClassFamilyAndClient) {
+    test::LogCapture log;
+    uint32_t effective = 0;
+    uint64_t error = 1;
+    // Bundle classes: only 33, whoever asks.
+    EXPECT_TRUE(validateUserId(33, 1, 0, &effective, &error));
+    EXPECT_EQ(effective, 33u);
+    for (uint32_t user : {0u, 1u, 501u})
+        EXPECT_FALSE(validateUserId(user, 1, 0, &effective, &error)) << user;
+    EXPECT_EQ(error, uint64_t{BTHErrorInvalidParameter});
+    EXPECT_TRUE(log.contains(3, "Invalid userId 501 for class 1 from client 0"));
+    // System classes: only 499.
+    EXPECT_TRUE(validateUserId(499, 13, 501, &effective, nullptr));
+    EXPECT_EQ(effective, 499u);
+    EXPECT_FALSE(validateUserId(1, 12, 0, nullptr, nullptr));
+    // A mobile client names only itself.
+    EXPECT_TRUE(validateUserId(1, 2, 501, &effective, nullptr));
+    EXPECT_EQ(effective, 501u);
+    EXPECT_TRUE(validateUserId(501, 7, 501, &effective, nullptr));
+    EXPECT_FALSE(validateUserId(502, 2, 501, &effective, nullptr));
+    EXPECT_FALSE(validateUserId(0, 2, 501, &effective, nullptr));
+    // A system client: 1 is the current mobile user, others only for per-user classes.
+    EXPECT_TRUE(validateUserId(1, 2, 0, &effective, nullptr));
+    EXPECT_EQ(effective, 501u);
+    EXPECT_TRUE(validateUserId(502, 11, 0, &effective, nullptr));
+    EXPECT_EQ(effective, 502u);
+    EXPECT_FALSE(validateUserId(502, 0, 0, &effective, nullptr));
+    EXPECT_FALSE(validateUserId(502, 14, 0, &effective, nullptr));
+    // Without an error location nothing is logged.
+    size_t before = log.lines().size();
+    EXPECT_FALSE(validateUserId(7, 1, 0, nullptr, nullptr));
+    EXPECT_EQ(log.lines().size(), before);
+}
+
+}  // namespace
+}  // namespace berth
