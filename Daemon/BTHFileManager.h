@@ -24,6 +24,7 @@
 #include <vector>
 
 #include "BTHError.h"
+#include "platform/TreeWalk.h"
 
 namespace berth {
 
@@ -36,34 +37,16 @@ struct BTHFileURL {
     std::string description() const { return path.string() + (isDirectory ? "/" : ""); }
 };
 
-// What the tree walk hands its callback for each item.
-struct BTHWalkEntry {
-    // The kinds of item the walk delivers (the callbacks of ACL and ownership
-    // standardisation switch on them).
-    enum class Kind {
-        DirectoryPre,    // a directory, before its contents
-        DirectoryPost,   // the same directory, after its contents
-        DirectoryCycle,  // a directory that is one of its own ancestors
-        Unreadable,      // a directory that could not be opened or read
-        File,            // a regular file
-        Symlink,         // a symbolic link (never followed)
-        Other,           // device, fifo, socket
-    };
-
-    std::filesystem::path path;
-    int level = 0;  // 0 for the root
-    Kind kind = Kind::Other;
-    struct stat st {};  // lstat information of the item
-    int errnum = 0;     // for Unreadable: why
-    // The directory holding the item (open for reading) and the item's name
-    // in it, so callbacks act on the item without resolving its path again.
-    // For the root, parentFd is the root's own parent.
-    int parentFd = -1;
-    std::string name;
-};
+// What the tree walk hands its callback for each item: its path, level,
+// kind (pre- and post-order directory, cycle, unreadable directory with its
+// error number, file, link, other), lstat information, and the directory
+// descriptor holding it plus its name there (and, for a directory that was
+// entered, its own descriptor), so callbacks act on the item without
+// resolving its path again.
+using BTHWalkEntry = fs::WalkEntry;
 
 class BTHFileManager {
-public:
+  public:
     static BTHFileManager& defaultManager();
 
     // Removes a file, link or directory tree. A missing item anywhere is not
@@ -123,7 +106,7 @@ public:
     bool itemExistsAtURL(const std::filesystem::path& url);
     bool itemDoesNotExistAtURL(const std::filesystem::path& url);
 
-private:
+  private:
     BTHFileManager() = default;
     bool copyItem(const std::filesystem::path& source, const std::filesystem::path& dest,
                   bool failIfSrcMissing, BTHErrorRef* error);
