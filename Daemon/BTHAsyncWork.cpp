@@ -1,0 +1,16 @@
+#include "BTHAsyncWork.h"
+
+#include "platform/RelayTransaction.h"
+
+namespace berth {
+
+void BTHPerformAsyncWork(const std::shared_ptr<WorkQueue>& queue, std::function<void()> work) {
+    auto transaction = std::make_shared<RelayTransaction::Guard>();
+    queue->async([transaction, work = std::move(work)]() mutable {
+        work();
+        // The transaction closes when this item (and its copy of the guard) is
+        // gone, whether the work returned or threw.
+    });
+}
+
+}  // namespace berth

@@ -1,0 +1,181 @@
+#include "BTHDaemon.h"
+
+#include <sys/socket.h>
+#include <syslog.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <optional>
+
+#include "BTHClientConnection.h"
+#include "BTHError.h"
+#include "BTHGlobalConfiguration.h"
+#include "BTHLockStateCallback.h"
+#include "BTHLog.h"
+#include "BTHRelayRequest.h"
+#include "BTHUncaughtExceptionReporter.h"
+#include "BTHUpcallServer.h"
+#include "platform/CodeSigningRegistry.h"
+#include "platform/DeviceProperties.h"
+#include "platform/LockStateNotification.h"
+#include "platform/NamedSemaphore.h"
+#include "platform/RelayListener.h"
+#include "platform/RelayTransaction.h"
+#include "platform/RunLoop.h"
+#include "platform/ServiceCheckIn.h"
+
+namespace berth {
+
+namespace {
+
+std::atomic<uint32_t> gLogFileCount{1};
+
+constexpr uint32_t kLogFileCount = 1;
+constexpr uint64_t kLogSizeLimit = 102400;
+constexpr uint32_t kInternalLogFileCount = 4;
+constexpr uint64_t kInternalLogSizeLimit = 262144;
+
+// Steps 2 to 5: the rotating log.
+void openRotatingLog() {
+    BTH_FUNCTION("main");
+    const std::filesystem::path logPath =
+        BTHGlobalConfiguration::sharedInstance().logDirectory() / "berthd.log";
+    const bool internal = DeviceProperties::isInternalBuild();
+    const uint32_t count = internal ? kInternalLogFileCount : kLogFileCount;
+    const uint64_t limit = internal ? kInternalLogSizeLimit : kLogSizeLimit;
+    gLogFileCount = count;
+    auto handle = std::make_shared<BTHLogHandle>(kBTHServiceName, BTHLogLevelNotice);
+    if (handle->enableDiskLogging(logPath, count, limit)) {
+        BTHLogSetHandle(handle);
+    } else {
+        syslog(LOG_ERR, "Failed to set up rotating logs at path %s", logPath.c_str());
+    }
+    BTHLogDebug("berthd built at %s %s started", __DATE__, __TIME__);
+}
+
+// Step 13: the marker that later launches in this boot skip first-boot work.
+void setFirstBootWorkCompleted() {
+    BTH_FUNCTION("set_first_boot_work_completed");
+    if (!NamedSemaphore::create(kBTHFirstBootSemaphoreName, 0400))
+        BTHLogError("Failed to create semaphore %s: %s", kBTHFirstBootSemaphoreName,
+                    strerror(errno));
+}
+
+// Step 12: follow the key bag's lock state on the main queue.
+void registerForLockStateChanges(RunLoop& runLoop) {
+    BTH_FUNCTION("main");
+    static LockStateNotification notification;
+    static BTHLockStateCallback callback(BTHLockStateQueue(),
+                                         [] { return LockStateNotification::lockState(); });
+    if (!notification.registerForChanges()) {
+        BTHLogError("notify_register_dispatch for notification \"%s\" failed; returned %d\n",
+                    LockStateNotification::kName, errno);
+    } else {
+        runLoop.watchReadable(notification.fd(), [] {
+            if (notification.drain()) callback.run();
+        });
+    }
+    callback.run();
+}
+
+// Step 16: the request listener on the concurrent listener queue.
+std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& listenerQueue) {
+    BTH_FUNCTION("main");
+    std::string why;
+    int error = 0;
+    std::optional<ServiceCheckIn> checkIn =
+        ServiceCheckIn::claim(kBTHServiceName, SOCK_STREAM, 0666, &error, &why);
+    if (!checkIn) {
+        BTHLogError("unable to start relay service!");
+        return nullptr;
+    }
+    // The claim (its lock) must outlive the listener: keep it for the process.
+    static std::optional<ServiceCheckIn> claim;
+    claim = std::move(checkIn);
+
+    RelayListener::Options options;
+    options.label = kBTHServiceName;
+    options.codeSigning = std::make_shared<CodeSigningRegistry>();
+    options.log = [](int level, const std::string& message) {
+        BTH_FUNCTION("BTHProcessRelayEvent");
+        BTHLog(level, "%@", message);
+    };
+    std::unique_ptr<RelayListener> listener =
+        RelayListener::make(claim->takeSocket(), listenerQueue, std::move(options), &why);
+    if (!listener) {
+        BTHLogError("unable to start relay service!");
+        return nullptr;
+    }
+    listener->setEventHandler([](const std::shared_ptr<RelayConnection>& connection) {
+        connection->setEventHandler([](const RelayEvent& event) { BTHProcessRelayEvent(event); });
+        connection->resume();
+    });
+    listener->resume();
+    return listener;
+}
+
+}  // namespace
+
+uint32_t BTHLogFileCount() {
+    return gLogFileCount;
+}
+
+const std::shared_ptr<WorkQueue>& BTHDeathRowQueue() {
+    static const std::shared_ptr<WorkQueue> queue =
+        WorkQueue::makeSerial("sys.kelp.berthd.deathrow", QueuePriority::background);
+    return queue;
+}
+
+const std::shared_ptr<WorkQueue>& BTHLockStateQueue() {
+    static const std::shared_ptr<WorkQueue> queue =
+        WorkQueue::makeSerial("sys.kelp.berthd.lockstate");
+    return queue;
+}
+
+int BTHDaemonMain() {
+    BTH_FUNCTION("main");
+    RunLoop& runLoop = RunLoop::main();
+    RelayTransaction::begin();  // step 1: busy until start-up is done
+    openRotatingLog();
+    BTHSetExceptionReporter(BTHReportUncaughtException);
+
+    if (!BTHDeathRowQueue() || !BTHLockStateQueue()) {
+        BTHLogError("Can't create dispatch queues. Exiting.");
+        return -1;
+    }
+    BTHDeathRowQueue()->setTarget(WorkQueue::global(QueuePriority::background));
+    BTHClientConnection::sharedClientConnection();
+
+    const bool firstBoot = !NamedSemaphore::exists(kBTHFirstBootSemaphoreName);
+    if (firstBoot) {
+        BTHLogNotice("berthd performing first boot initialization");
+        // The once-per-boot setup of the container store runs here once the
+        // store's maintenance operations are built into the daemon.
+    }
+    // Every launch: recovery of interrupted replaces runs here once replace
+    // is built into the daemon.
+
+    std::unique_ptr<BTHUpcallServer> upcall = BTHUpcallServer::start(runLoop);
+    if (!upcall) {
+        BTHLogError("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
+        return -1;
+    }
+    registerForLockStateChanges(runLoop);
+
+    if (firstBoot) {
+        BTHLogNotice("berthd first boot cleanup complete");
+        setFirstBootWorkCompleted();
+    }
+    // Every launch: clean-up of staging leftovers and death row runs here
+    // once deletion is built into the daemon.
+    RelayTransaction::end();
+
+    const std::shared_ptr<WorkQueue> listenerQueue =
+        WorkQueue::makeConcurrent("sys.kelp.berthd.listener");
+    std::unique_ptr<RelayListener> listener = startListener(listenerQueue);
+    runLoop.run();
+    return 0;
+}
+
+}  // namespace berth

@@ -1,0 +1,59 @@
+#include "BTHRelayRequest.h"
+
+#include "BTHLog.h"
+#include "BTHRequest.h"
+#include "BTHRequestIntake.h"
+
+namespace berth {
+
+namespace {
+
+BTHPeerIdentity toPeerIdentity(const RelayPeerIdentity& relay) {
+    BTHPeerIdentity peer;
+    peer.pid = relay.pid;
+    peer.effectiveUserId = relay.effectiveUserId;
+    peer.processStillBound = relay.processStillBound;
+    peer.signingIdentifier = relay.signingIdentifier;
+    peer.signingError = relay.signingError;
+    peer.entitlements = relay.entitlements;
+    return peer;
+}
+
+// A request of the message service, with its reply. The identity is taken
+// when the request is processed, so a peer that exec'd or exited since it
+// connected is seen as it is now.
+class RelayRequest final : public BTHRequest {
+  public:
+    RelayRequest(const RelayEvent& event, RelayReply reply)
+        : message_(event.message()),
+          reply_(std::move(reply)),
+          peer_(toPeerIdentity(event.connection()->peerIdentity())) {}
+
+    const Value& message() const override { return message_; }
+    Value& reply() override { return reply_.body(); }
+    const BTHPeerIdentity& peer() const override { return peer_; }
+    void sendReply() override {
+        if (!reply_.sent()) reply_.send();
+    }
+
+  private:
+    Value message_;
+    RelayReply reply_;
+    BTHPeerIdentity peer_;
+};
+
+}  // namespace
+
+void BTHProcessRelayEvent(const RelayEvent& event) {
+    BTH_FUNCTION("BTHProcessRelayEvent");
+    if (event.isConnectionInvalid()) return;
+    std::optional<RelayReply> reply = event.makeReply();
+    if (!reply) {
+        BTHLogError("Dictionary does not have reply context");
+        event.connection()->cancel();
+        return;
+    }
+    BTHProcessRequest(std::make_shared<RelayRequest>(event, std::move(*reply)));
+}
+
+}  // namespace berth
