@@ -1,0 +1,164 @@
+// Start-up of the real daemon on a scratch device root: the once-per-boot
+// marker, refusal to start beside another instance, the upcall socket's
+// error replies, and the request socket's intake.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
+#include <cstring>
+#include <thread>
+
+#include "BTHDaemon.h"
+#include "BTHUpcallServer.h"
+#include "DaemonProcess.h"
+#include "ScratchDeviceRoot.h"
+#include "TestSupport.h"
+#include "client/libberth/BerthConnection.h"
+#include "core/ErrorCodes.h"
+#include "platform/NamedSemaphore.h"
+#include "platform/ServiceCheckIn.h"
+
+namespace berth {
+namespace {
+
+const std::filesystem::path& root() {
+    static const std::filesystem::path& path = test::installScratchDeviceRoot();
+    return path;
+}
+const bool kRootInstalled = !root().empty();
+
+std::string logText() {
+    return test::readFile(root() / "private/var/root/Library/Logs/Berth/berthd.log");
+}
+
+size_t occurrences(const std::string& text, const std::string& what) {
+    size_t n = 0;
+    for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+    return n;
+}
+
+class DaemonStartupTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        BERTH_REQUIRE_ROOT();
+        ASSERT_TRUE(kRootInstalled);
+        NamedSemaphore::remove(kBTHFirstBootSemaphoreName);
+    }
+    void TearDown() override { NamedSemaphore::remove(kBTHFirstBootSemaphoreName); }
+};
+
+uint64_t replyError(const std::optional<Value>& reply) {
+    if (!reply) return 0;
+    const Value* code = reply->find("ReplyError");
+    return code ? code->uint64Value().value_or(0) : 0;
+}
+
+std::optional<Value> request(BerthConnection& connection, Value message) {
+    BerthError error;
+    auto reply = connection.request(message, std::chrono::seconds(10), &error);
+    EXPECT_FALSE(error) << error.message;
+    return reply;
+}
+
+Value command(uint64_t n) {
+    Value m = Value::dictionary();
+    m.set("Command", n);
+    return m;
+}
+
+TEST_F(DaemonStartupTest, FirstBootWorkRunsOncePerBoot) {
+    const std::string before = logText();
+    {
+        test::DaemonProcess daemon(root());
+        ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
+        EXPECT_TRUE(NamedSemaphore::exists(kBTHFirstBootSemaphoreName));
+        daemon.stop(SIGTERM);
+    }
+    {
+        test::DaemonProcess daemon(root());
+        ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
+        daemon.stop(SIGKILL);
+    }
+    const std::string added = logText().substr(before.size());
+    EXPECT_EQ(occurrences(added, "berthd performing first boot initialization"), 1u) << added;
+    EXPECT_EQ(occurrences(added, "berthd first boot cleanup complete"), 1u) << added;
+}
+
+TEST_F(DaemonStartupTest, UpcallCheckInFailureExitsWith255AndLeavesNoMarker) {
+    // Another holder of the upcall endpoint: the daemon must not start.
+    int error = 0;
+    auto holder = ServiceCheckIn::claim(kBTHUpcallServiceName, SOCK_SEQPACKET, 0600, &error);
+    ASSERT_TRUE(holder) << strerror(error);
+    test::DaemonProcess daemon(root());
+    EXPECT_EQ(daemon.waitForExit(), 255);
+    EXPECT_FALSE(NamedSemaphore::exists(kBTHFirstBootSemaphoreName));
+    EXPECT_NE(logText().find("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting."),
+              std::string::npos);
+}
+
+TEST_F(DaemonStartupTest, SecondInstanceExitsAndTheFirstKeepsServing) {
+    test::DaemonProcess first(root());
+    ASSERT_TRUE(first.waitUntilServing()) << first.standardError();
+    test::DaemonProcess second(root());
+    EXPECT_EQ(second.waitForExit(), 255);
+    auto connection = BerthConnection::connect(first.requestSocket());
+    ASSERT_TRUE(connection);
+    EXPECT_EQ(replyError(request(*connection, command(30))), uint64_t{BTHErrorInvalidCommand});
+    first.stop(SIGKILL);
+
+    // A socket left by a killed instance is replaced by the next one.
+    test::DaemonProcess third(root());
+    ASSERT_TRUE(third.waitUntilServing()) << third.standardError();
+}
+
+TEST_F(DaemonStartupTest, RequestsFromAnUnsignedCallerReachOnlyOpenCommands) {
+    test::DaemonProcess daemon(root());
+    ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
+    auto connection = BerthConnection::connect(daemon.requestSocket());
+    ASSERT_TRUE(connection);
+    // This test program has no signature: no identifier, no entitlements.
+    EXPECT_EQ(replyError(request(*connection, command(1))), uint64_t{BTHErrorNotEntitled});
+    EXPECT_EQ(replyError(request(*connection, command(24))), uint64_t{BTHErrorNotEntitled});
+    EXPECT_EQ(replyError(request(*connection, command(30))), uint64_t{BTHErrorInvalidCommand});
+    EXPECT_EQ(replyError(request(*connection, command(uint64_t{1} << 33))),
+              uint64_t{BTHErrorInvalidCommand});
+    // Command 0 is open to every caller; its handler is not built in yet.
+    EXPECT_EQ(replyError(request(*connection, Value::dictionary())),
+              uint64_t{BTHErrorInvalidCommand});
+    EXPECT_NE(logText().find("missing required entitlement: sys.kelp.private.Berth.allowed"),
+              std::string::npos);
+}
+
+TEST_F(DaemonStartupTest, UpcallRequestsGetErrorReplies) {
+    test::DaemonProcess daemon(root());
+    ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
+    int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
+    ASSERT_GE(fd, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    const auto path = root() / "run/berthd/sys.kelp.berthd.upcall";
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    ASSERT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+
+    for (uint32_t id : {kBTHUpcallRequestId, kBTHUpcallRequestId + 1}) {
+        uint32_t message[13] = {};
+        message[0] = 0x80000000u | 0x12;  // complex, reply-port disposition 0x12
+        message[1] = 52;
+        message[2] = 0x1234;  // reply port
+        message[5] = id;
+        ASSERT_EQ(::send(fd, message, sizeof message, 0), 52);
+        uint32_t reply[16] = {};
+        ASSERT_EQ(::recv(fd, reply, sizeof reply, 0), 36);
+        EXPECT_EQ(reply[0], 0x12u);
+        EXPECT_EQ(reply[1], 36u);
+        EXPECT_EQ(reply[2], 0x1234u);
+        EXPECT_EQ(reply[5], id + 100);
+        EXPECT_EQ(static_cast<int32_t>(reply[8]),
+                  id == kBTHUpcallRequestId ? kBTHUpcallCannotServe : kBTHUpcallBadMessageId);
+    }
+    ::close(fd);
+}
+
+}  // namespace
+}  // namespace berth
