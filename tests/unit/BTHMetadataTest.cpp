@@ -301,7 +301,7 @@ TEST_F(BTHMetadataTest, TheClassPathIsComparedAsPathStrings) {
 TEST_F(BTHMetadataTest, XMLFilesAreReadLikeBinaryOnes) {
     const fs::path url = makeContainer("Data/Application");
     test::writeFile(BTHMetadata::metadataFileURL(url), R"(<?xml version="1.0" encoding="UTF-8"?>
-<!DOCTYPE plist PUBLIC "-//Apple//DTD PLIST 1.0//EN" "http://www.apple.com/DTDs/PropertyList-1.0.dtd">
+<!DOCTYPE plist>
 <plist version="1.0">
 <dict>
     <key>BTHMetadataContentClass</key><integer>2</integer>
