@@ -1,0 +1,256 @@
+#include "platform/RelayConnection.h"
+
+#include <sys/epoll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace berth {
+namespace {
+
+constexpr int kLogError = 3;
+constexpr int kLogDebug = 7;
+
+}  // namespace
+
+bool RelayReply::send() {
+    if (sent_) return false;
+    sent_ = true;
+    std::shared_ptr<RelayConnection> remote = remote_.lock();
+    return remote && remote->sendReply(messageId_, body_);
+}
+
+RelayEvent RelayEvent::message(std::shared_ptr<RelayConnection> connection, relay::Frame frame) {
+    RelayEvent event(Type::Message, std::move(connection));
+    event.kind_ = frame.kind;
+    event.messageId_ = frame.messageId;
+    event.message_ = std::move(frame.body);
+    return event;
+}
+
+RelayEvent RelayEvent::connectionInvalid(std::shared_ptr<RelayConnection> connection) {
+    return RelayEvent(Type::ConnectionInvalid, std::move(connection));
+}
+
+std::optional<RelayReply> RelayEvent::makeReply() const {
+    if (!awaitsReply()) return std::nullopt;
+    return RelayReply(connection_, messageId_);
+}
+
+std::shared_ptr<RelayConnection> RelayConnection::make(UniqueFd socket, RelayPeer peer,
+                                                       std::shared_ptr<RelayPoller> poller,
+                                                       Options options) {
+    return std::make_shared<RelayConnection>(Passkey{}, std::move(socket), std::move(peer),
+                                             std::move(poller), std::move(options));
+}
+
+RelayConnection::RelayConnection(Passkey, UniqueFd socket, RelayPeer peer,
+                                 std::shared_ptr<RelayPoller> poller, Options options)
+    : peer_(std::move(peer)),
+      poller_(std::move(poller)),
+      options_(std::move(options)),
+      queue_(WorkQueue::makeSerial(options_.label)),
+      socket_(std::move(socket)) {
+    if (options_.target) queue_->setTarget(options_.target);
+    // Events wait until the owner has set its handler and resumed.
+    queue_->suspend();
+}
+
+RelayConnection::~RelayConnection() {
+    // A connection never resumed still holds its queue suspended; its
+    // pending events go with it.
+}
+
+void RelayConnection::setEventHandler(EventHandler handler) {
+    std::lock_guard lock(mutex_);
+    handler_ = std::move(handler);
+}
+
+void RelayConnection::resume() {
+    {
+        Released released(*this);
+        std::lock_guard lock(mutex_);
+        if (resumed_) return;
+        resumed_ = true;
+        if (!closed_) {
+            interest_ = EPOLLIN;
+            token_ = poller_->add(socket_.get(), interest_, shared_from_this());
+            if (token_ == 0)
+                closeLocked(kLogError,
+                            std::string("cannot watch the connection: ") + strerror(errno),
+                            released);
+        }
+    }
+    queue_->resume();
+}
+
+void RelayConnection::cancel() {
+    Released released(*this);
+    std::lock_guard lock(mutex_);
+    closeLocked(kLogDebug, "cancelled", released);
+}
+
+bool RelayConnection::isOpen() const {
+    std::lock_guard lock(mutex_);
+    return !closed_;
+}
+
+bool RelayConnection::sendReply(uint64_t messageId, const Value& body) {
+    std::vector<uint8_t> frame;
+    relay::CodecError error = relay::CodecError::None;
+    const bool encoded =
+        relay::encodeFrame({relay::FrameKind::Reply, messageId, body}, frame, &error);
+
+    Released released(*this);
+    std::lock_guard lock(mutex_);
+    if (closed_) return false;
+    if (!encoded) {
+        // The peer would wait for this reply forever; ending the connection
+        // tells it at once.
+        closeLocked(kLogError,
+                    "cannot encode the reply to message " + std::to_string(messageId) + ": " +
+                        relay::describe(error),
+                    released);
+        return false;
+    }
+    if (pendingOutputLocked() + frame.size() > options_.limits.maxBufferedOutput) {
+        closeLocked(kLogError, "the peer leaves its replies unread", released);
+        return false;
+    }
+    output_.insert(output_.end(), frame.begin(), frame.end());
+    if (!flushLocked(released)) return false;
+    updateInterestLocked();
+    return true;
+}
+
+void RelayConnection::ready(uint32_t events) {
+    Released released(*this);
+    std::lock_guard lock(mutex_);
+    if (closed_) return;
+    if ((events & EPOLLOUT) && !flushLocked(released)) return;
+    if (events & EPOLLIN) {
+        readLocked(released);
+    } else if (events & (EPOLLHUP | EPOLLERR)) {
+        closeLocked(kLogDebug, "the peer hung up", released);
+    }
+    updateInterestLocked();
+}
+
+void RelayConnection::readLocked(Released& released) {
+    std::vector<uint8_t> chunk(options_.limits.readChunk);
+    const ssize_t count = ::read(socket_.get(), chunk.data(), chunk.size());
+    if (count == 0) {
+        closeLocked(kLogDebug, "the peer closed the connection", released);
+    } else if (count < 0) {
+        if (errno != EAGAIN && errno != EINTR)
+            closeLocked(kLogDebug, std::string("read failed: ") + strerror(errno), released);
+    } else {
+        decoder_.feed(std::span<const uint8_t>(chunk.data(), static_cast<size_t>(count)));
+        pumpLocked(released);
+    }
+}
+
+void RelayConnection::pumpLocked(Released& released) {
+    while (!closed_ && queued_ < options_.limits.maxQueuedRequests) {
+        relay::Frame frame;
+        const relay::FrameDecoder::Status status = decoder_.next(frame);
+        if (status == relay::FrameDecoder::Status::NeedMore) return;
+        if (status == relay::FrameDecoder::Status::Error) {
+            closeLocked(kLogError,
+                        std::string("protocol error: ") + relay::describe(decoder_.error()),
+                        released);
+            return;
+        }
+        if (frame.kind == relay::FrameKind::Reply) {
+            closeLocked(kLogError, "protocol error: a reply frame from a client", released);
+            return;
+        }
+        ++queued_;
+        dispatchLocked(RelayEvent::message(shared_from_this(), std::move(frame)));
+    }
+}
+
+bool RelayConnection::flushLocked(Released& released) {
+    while (pendingOutputLocked() > 0) {
+        const ssize_t count = ::send(socket_.get(), output_.data() + outputStart_,
+                                     pendingOutputLocked(), MSG_NOSIGNAL | MSG_DONTWAIT);
+        if (count < 0) {
+            if (errno == EINTR) continue;
+            if (errno == EAGAIN) break;
+            closeLocked(kLogDebug, std::string("write failed: ") + strerror(errno), released);
+            return false;
+        }
+        outputStart_ += static_cast<size_t>(count);
+    }
+    if (outputStart_ == output_.size()) {
+        output_.clear();
+        outputStart_ = 0;
+    } else if (outputStart_ > output_.size() / 2) {
+        output_.erase(output_.begin(), output_.begin() + static_cast<ptrdiff_t>(outputStart_));
+        outputStart_ = 0;
+    }
+    return true;
+}
+
+void RelayConnection::updateInterestLocked() {
+    if (closed_ || token_ == 0) return;
+    uint32_t wanted = 0;
+    if (queued_ < options_.limits.maxQueuedRequests &&
+        pendingOutputLocked() <= options_.limits.outputHighWater)
+        wanted |= EPOLLIN;
+    if (pendingOutputLocked() > 0) wanted |= EPOLLOUT;
+    if (wanted == interest_) return;
+    if (poller_->modify(socket_.get(), token_, wanted) == 0) interest_ = wanted;
+}
+
+void RelayConnection::closeLocked(int level, const std::string& reason, Released& released) {
+    if (closed_) return;
+    closed_ = true;
+    released.lines.emplace_back(level, reason);
+    if (token_ != 0) released.watcher = poller_->remove(socket_.get(), token_);
+    token_ = 0;
+    socket_.reset();
+    decoder_ = relay::FrameDecoder();
+    output_ = {};
+    outputStart_ = 0;
+    dispatchLocked(RelayEvent::connectionInvalid(shared_from_this()));
+}
+
+void RelayConnection::dispatchLocked(RelayEvent event) {
+    queue_->async([self = shared_from_this(), event = std::move(event)] { self->deliver(event); });
+}
+
+void RelayConnection::deliver(const RelayEvent& event) {
+    EventHandler handler;
+    {
+        std::lock_guard lock(mutex_);
+        // A request that has not started when its connection ended is
+        // dropped: nobody is left to read its reply.
+        if (!closed_ || event.isConnectionInvalid()) handler = handler_;
+    }
+    if (handler) handler(event);
+
+    Released released(*this);
+    EventHandler last;  // dropped after the lock is let go
+    std::lock_guard lock(mutex_);
+    if (event.isConnectionInvalid()) {
+        last = std::move(handler_);
+        handler_ = nullptr;
+        return;
+    }
+    --queued_;
+    pumpLocked(released);
+    updateInterestLocked();
+}
+
+RelayConnection::Released::~Released() {
+    const Options& options = connection_.options_;
+    if (!options.log) return;
+    for (const auto& [level, message] : lines)
+        options.log(level,
+                    options.label + " (pid " + std::to_string(connection_.pid()) + "): " + message);
+}
+
+}  // namespace berth

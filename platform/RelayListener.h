@@ -1,0 +1,80 @@
+// The listener of the relay: accepts peers on a checked-in stream socket and
+// hands each new connection to its event handler.
+//
+//   auto listener = RelayListener::make(checkIn.takeSocket(), listenerQueue, options);
+//   listener->setEventHandler([](const std::shared_ptr<RelayConnection>& peer) {
+//       peer->setEventHandler([peer](const RelayEvent& event) { ... });
+//       peer->resume();
+//   });
+//   listener->resume();
+//
+// New connections are handed over on the listener's queue. Each connection's
+// own serial queue runs on that queue too, so with a concurrent listener
+// queue different peers are served in parallel.
+//
+// Accepting never waits on a peer: one I/O thread accepts and serves the
+// sockets of all connections, non-blocking, whatever their number; a peer's
+// credentials, pidfd and executable are taken at accept (see RelayPeer) and
+// its signing identity is left for the requests to evaluate.
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/CodeSigningRegistry.h"
+#include "platform/RelayConnection.h"
+#include "platform/RelayPoller.h"
+#include "platform/UniqueFd.h"
+#include "platform/WorkQueue.h"
+
+namespace berth {
+
+class RelayListener {
+  public:
+    struct Options {
+        // Names the threads, queues and log lines of the listener.
+        std::string label = "sys.kelp.berthd";
+        // Identifies the peers; null: a CodeSigningRegistry over the device
+        // root's signature registry.
+        std::shared_ptr<CodeSigningService> codeSigning;
+        RelayLimits limits;
+        RelayLog log;
+    };
+
+    using EventHandler = std::function<void(const std::shared_ptr<RelayConnection>&)>;
+
+    // A suspended listener on the listening, non-blocking stream socket
+    // `socket`, handing connections over on `queue` (null: the global
+    // queue). Null, with the reason, when the I/O thread cannot be set up.
+    static std::unique_ptr<RelayListener> make(UniqueFd socket, std::shared_ptr<WorkQueue> queue,
+                                               Options options, std::string* why = nullptr);
+
+    // Stops accepting, ends every connection it accepted and stops the I/O
+    // thread. Events already queued are still delivered.
+    ~RelayListener();
+    RelayListener(const RelayListener&) = delete;
+    RelayListener& operator=(const RelayListener&) = delete;
+
+    // Sets the handler of new connections. A connection accepted while no
+    // handler is set is cancelled.
+    void setEventHandler(EventHandler handler);
+    // Starts accepting. Later calls do nothing.
+    void resume();
+
+    // Connections accepted and not yet ended.
+    size_t connectionCount() const;
+
+  private:
+    class Acceptor;
+
+    RelayListener(std::shared_ptr<RelayPoller> poller, std::shared_ptr<Acceptor> acceptor);
+
+    std::shared_ptr<RelayPoller> poller_;
+    std::shared_ptr<Acceptor> acceptor_;
+};
+
+}  // namespace berth

@@ -1,0 +1,114 @@
+#include "platform/RelayPoller.h"
+
+#include <pthread.h>
+#include <sys/eventfd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace berth {
+namespace {
+
+// The wake eventfd's token; registrations count from 1.
+constexpr uint64_t kWakeToken = 0;
+constexpr int kEventsPerWait = 64;
+
+}  // namespace
+
+std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, std::string* why) {
+    std::shared_ptr<RelayPoller> poller(new RelayPoller());
+    poller->epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
+    poller->wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    epoll_event event{};
+    event.events = EPOLLIN;
+    event.data.u64 = kWakeToken;
+    if (!poller->epoll_ || !poller->wake_ ||
+        ::epoll_ctl(poller->epoll_.get(), EPOLL_CTL_ADD, poller->wake_.get(), &event) != 0) {
+        if (why) *why = std::string("cannot set up the relay's epoll loop: ") + strerror(errno);
+        return nullptr;
+    }
+    // The thread holds the poller until it ends, so a watcher that drops
+    // the last other reference from inside ready() cannot free the loop
+    // under its feet.
+    poller->thread_ = std::thread([self = poller, name = threadName.substr(0, 15)] {
+        ::pthread_setname_np(::pthread_self(), name.c_str());
+        self->run();
+    });
+    return poller;
+}
+
+RelayPoller::~RelayPoller() {
+    // Only reached once the thread has left run(): it holds a reference
+    // while it runs.
+    if (thread_.joinable()) {
+        if (isPollerThread())
+            thread_.detach();
+        else
+            thread_.join();
+    }
+}
+
+uint64_t RelayPoller::add(int fd, uint32_t events, std::shared_ptr<Watcher> watcher) {
+    std::lock_guard lock(mutex_);
+    const uint64_t token = nextToken_++;
+    epoll_event event{};
+    event.events = events;
+    event.data.u64 = token;
+    if (::epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, fd, &event) != 0) return 0;
+    watchers_.emplace(token, std::move(watcher));
+    return token;
+}
+
+int RelayPoller::modify(int fd, uint64_t token, uint32_t events) {
+    epoll_event event{};
+    event.events = events;
+    event.data.u64 = token;
+    return ::epoll_ctl(epoll_.get(), EPOLL_CTL_MOD, fd, &event) == 0 ? 0 : errno;
+}
+
+std::shared_ptr<RelayPoller::Watcher> RelayPoller::remove(int fd, uint64_t token) {
+    ::epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, fd, nullptr);
+    std::lock_guard lock(mutex_);
+    auto found = watchers_.find(token);
+    if (found == watchers_.end()) return nullptr;
+    std::shared_ptr<Watcher> watcher = std::move(found->second);
+    watchers_.erase(found);
+    return watcher;
+}
+
+void RelayPoller::stop() {
+    {
+        std::lock_guard lock(mutex_);
+        if (!stopping_) {
+            stopping_ = true;
+            const uint64_t one = 1;
+            (void)!::write(wake_.get(), &one, sizeof one);
+        }
+    }
+    std::lock_guard join(joinMutex_);
+    if (thread_.joinable() && !isPollerThread()) thread_.join();
+}
+
+void RelayPoller::run() {
+    epoll_event events[kEventsPerWait];
+    for (;;) {
+        const int count = ::epoll_wait(epoll_.get(), events, kEventsPerWait, -1);
+        if (count < 0 && errno != EINTR) return;
+        for (int i = 0; i < count; ++i) {
+            std::shared_ptr<Watcher> watcher;
+            {
+                std::lock_guard lock(mutex_);
+                if (stopping_) return;
+                if (events[i].data.u64 == kWakeToken) continue;
+                auto found = watchers_.find(events[i].data.u64);
+                if (found == watchers_.end()) continue;  // removed after it was collected
+                watcher = found->second;
+            }
+            watcher->ready(events[i].events);
+        }
+        std::lock_guard lock(mutex_);
+        if (stopping_) return;
+    }
+}
+
+}  // namespace berth

@@ -1,0 +1,223 @@
+// A relay server for the relay's test programs: a checked-in socket in a
+// scratch directory, a listener on a concurrent queue, and a per-request
+// handler supplied by the test. Records what the connections went through.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "TestSupport.h"
+#include "core/RelayCodec.h"
+#include "platform/RelayListener.h"
+#include "platform/ServiceCheckIn.h"
+
+namespace berth::test {
+
+// Peers are unsigned; a peer keeps its (unsigned) identity while it runs the
+// executable it connected with.
+class UnsignedPeers final : public CodeSigningService {
+  public:
+    std::optional<PeerIdentity> identify(pid_t, int, std::string* why) override {
+        if (why) *why = "no signature";
+        return std::nullopt;
+    }
+    std::optional<ExecutableId> executableOf(pid_t pid, int pidfd, std::string* why) override {
+        return runningExecutable(pid, pidfd, why);
+    }
+};
+
+class RelayTestServer {
+  public:
+    // Fills the reply of a request; returns false to leave it unsent.
+    using Handler = std::function<bool(const RelayEvent&, RelayReply&)>;
+
+    explicit RelayTestServer(Handler handler, RelayLimits limits = {},
+                             std::shared_ptr<CodeSigningService> signing = nullptr)
+        : handler_(std::move(handler)) {
+        int error = 0;
+        std::string why;
+        auto checkIn =
+            ServiceCheckIn::claim("relay.test", SOCK_STREAM, 0666, &error, &why, directory_.path());
+        if (!checkIn) {
+            ADD_FAILURE() << why;
+            return;
+        }
+        path_ = checkIn->path();
+        RelayListener::Options options;
+        options.label = "relay.test";
+        options.limits = limits;
+        options.codeSigning = signing ? signing : std::make_shared<UnsignedPeers>();
+        options.log = [this](int level, const std::string& line) {
+            std::lock_guard lock(mutex_);
+            log_.push_back(std::to_string(level) + " " + line);
+        };
+        listener_ = RelayListener::make(checkIn->takeSocket(),
+                                        WorkQueue::makeConcurrent("relay.test.listener"),
+                                        std::move(options), &why);
+        checkIn_.emplace(std::move(*checkIn));
+        if (!listener_) {
+            ADD_FAILURE() << why;
+            return;
+        }
+        listener_->setEventHandler([this](const std::shared_ptr<RelayConnection>& connection) {
+            connection->setEventHandler(
+                [this, connection](const RelayEvent& event) { onEvent(connection, event); });
+            connection->resume();
+        });
+        listener_->resume();
+    }
+
+    ~RelayTestServer() { listener_.reset(); }
+
+    const std::filesystem::path& path() const { return path_; }
+    RelayListener& listener() { return *listener_; }
+
+    // A raw client socket connected to the server.
+    UniqueFd connectRaw() const {
+        UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        std::strncpy(address.sun_path, path_.c_str(), sizeof address.sun_path - 1);
+        EXPECT_EQ(::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0)
+            << strerror(errno);
+        // Reads give up eventually, so a server that never answers fails the
+        // test instead of hanging it.
+        timeval limit{20, 0};
+        ::setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+        return fd;
+    }
+
+    // Waits until `predicate` holds, or a generous limit that only a broken
+    // server reaches. The predicate runs without the server's lock held.
+    bool waitFor(const std::function<bool()>& predicate) {
+        const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+        while (!predicate()) {
+            if (std::chrono::steady_clock::now() > limit) return false;
+            std::unique_lock lock(mutex_);
+            changed_.wait_for(lock, std::chrono::milliseconds(10));
+        }
+        return true;
+    }
+
+    size_t invalidated() {
+        std::lock_guard lock(mutex_);
+        return invalidated_;
+    }
+    // The replies whose send() failed (the peer was gone).
+    size_t unsent() {
+        std::lock_guard lock(mutex_);
+        return unsent_;
+    }
+    std::vector<std::string> log() {
+        std::lock_guard lock(mutex_);
+        return log_;
+    }
+    bool logged(const std::string& text) {
+        for (const auto& line : log())
+            if (line.find(text) != std::string::npos) return true;
+        return false;
+    }
+
+    // Lets the test wait on its own conditions under the server's lock.
+    std::mutex& mutex() { return mutex_; }
+    void notify() { changed_.notify_all(); }
+
+  private:
+    void onEvent(const std::shared_ptr<RelayConnection>& connection, const RelayEvent& event) {
+        if (event.isConnectionInvalid()) {
+            std::lock_guard lock(mutex_);
+            ++invalidated_;
+            changed_.notify_all();
+            return;
+        }
+        std::optional<RelayReply> reply = event.makeReply();
+        if (!reply) {
+            connection->cancel();
+            return;
+        }
+        if (handler_(event, *reply) && !reply->send()) {
+            std::lock_guard lock(mutex_);
+            ++unsent_;
+            changed_.notify_all();
+        }
+    }
+
+    Handler handler_;
+    ScratchDir directory_;
+    std::filesystem::path path_;
+    std::optional<ServiceCheckIn> checkIn_;
+    std::unique_ptr<RelayListener> listener_;
+
+    std::mutex mutex_;
+    std::condition_variable changed_;
+    size_t invalidated_ = 0;
+    size_t unsent_ = 0;
+    std::vector<std::string> log_;
+};
+
+// Encodes one frame.
+inline std::vector<uint8_t> frameBytes(relay::FrameKind kind, uint64_t id, const Value& body) {
+    std::vector<uint8_t> bytes;
+    EXPECT_TRUE(relay::encodeFrame({kind, id, body}, bytes));
+    return bytes;
+}
+
+inline bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
+    size_t done = 0;
+    while (done < bytes.size()) {
+        const ssize_t count = ::send(fd, bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
+        if (count < 0 && errno == EINTR) continue;
+        if (count <= 0) return false;
+        done += static_cast<size_t>(count);
+    }
+    return true;
+}
+
+// Reads frames from a blocking socket until `count` arrived, or the stream
+// ends or breaks.
+inline std::vector<relay::Frame> readFrames(int fd, size_t count) {
+    relay::FrameDecoder decoder;
+    std::vector<relay::Frame> frames;
+    uint8_t chunk[4096];
+    while (frames.size() < count) {
+        relay::Frame frame;
+        auto status = decoder.next(frame);
+        if (status == relay::FrameDecoder::Status::Frame) {
+            frames.push_back(std::move(frame));
+            continue;
+        }
+        if (status == relay::FrameDecoder::Status::Error) break;
+        const ssize_t got = ::read(fd, chunk, sizeof chunk);
+        if (got < 0 && errno == EINTR) continue;
+        if (got <= 0) break;
+        decoder.feed(std::span<const uint8_t>(chunk, static_cast<size_t>(got)));
+    }
+    return frames;
+}
+
+// True when the peer closed `fd` (reads reach the end of the stream).
+inline bool readsEndOfStream(int fd) {
+    uint8_t byte;
+    ssize_t got;
+    do got = ::read(fd, &byte, 1);
+    while (got < 0 && errno == EINTR);
+    return got == 0 || (got < 0 && errno == ECONNRESET);
+}
+
+inline Value dictionaryWith(const std::string& key, Value value) {
+    Value dictionary = Value::dictionary();
+    dictionary.set(key, std::move(value));
+    return dictionary;
+}
+
+}  // namespace berth::test
