@@ -204,6 +204,17 @@ int makePath(const std::filesystem::path& path, mode_t mode) {
     return 0;
 }
 
+int renameNoFollow(const std::filesystem::path& from, const std::filesystem::path& to) {
+    std::string fromName, toName;
+    UniqueFd fromParent = openParentNoFollow(from, &fromName);
+    if (!fromParent) return errno;
+    UniqueFd toParent = openParentNoFollow(to, &toName);
+    if (!toParent) return errno;
+    return ::renameat(fromParent.get(), fromName.c_str(), toParent.get(), toName.c_str()) == 0
+               ? 0
+               : errno;
+}
+
 int chmodAtNoFollow(int dirFd, const char* name, mode_t mode) {
     if (::syscall(SYS_fchmodat2, dirFd, name, mode, AT_SYMLINK_NOFOLLOW) == 0) return 0;
     if (errno != ENOSYS) return errno;

@@ -64,6 +64,10 @@ inline bool sameItem(const struct stat& a, const struct stat& b) {
 // whatever kind), otherwise the error number of the component that failed.
 int makePath(const std::filesystem::path& path, mode_t mode);
 
+// Renames `from` to `to`, each reached without following a link in any
+// component (a link as the last component of `from` is renamed itself).
+int renameNoFollow(const std::filesystem::path& from, const std::filesystem::path& to);
+
 // Sets the mode of `name` in `dirFd` without following a link (the item is
 // opened O_PATH and changed through that descriptor).
 int chmodAtNoFollow(int dirFd, const char* name, mode_t mode);

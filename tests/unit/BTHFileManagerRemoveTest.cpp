@@ -178,7 +178,9 @@ TEST(BTHFileManagerRemove, AnItemThatIsNotImmutableKeepsItsEPERM) {
 
     // Clean up what the scratch directory cannot.
     UniqueFd fd(::open((tree / "log").c_str(), O_RDONLY | O_CLOEXEC));
-    ASSERT_EQ(fileflags::set(fd.get(), 0), 0);
+    unsigned flags = 0;
+    ASSERT_EQ(fileflags::get(fd.get(), &flags), 0);
+    ASSERT_EQ(fileflags::set(fd.get(), flags & ~fileflags::kAppend), 0);
 }
 
 // The app owning a tree swaps one of its subdirectories for a link to a
