@@ -89,7 +89,7 @@ enum class QueuePriority {
 class ThreadPool final : public Executor {
   public:
     struct Options {
-        // Prefix of the worker threads' names (at most 11 characters are
+        // Prefix of the worker threads' names (at most 10 characters are
         // kept, the worker number follows).
         std::string name = "berth-pool";
         // Upper bound of live workers; items wait when it is reached.

@@ -27,6 +27,10 @@ namespace {
 using namespace std::chrono_literals;
 
 constexpr auto kDeadline = 60s;
+// How long a deliberately blocked item waits for its release. Longer than
+// kDeadline, so a check that waits for other work to get past blocked items
+// fails before the blocked items give up by themselves.
+constexpr std::chrono::milliseconds kBlocked = 10min;
 
 // A one-shot signal between threads.
 class Event {
@@ -157,7 +161,7 @@ TEST(WorkQueueTest, SyncReturnsResultAfterEarlierItemsAndPassesOnExceptions) {
     auto queue = WorkQueue::makeSerial("test.sync");
     Event release;
     int counter = 0;  // touched only on the queue
-    queue->async([&] { release.wait(); });
+    queue->async([&] { release.wait(kBlocked); });
     for (int i = 0; i < 100; ++i) queue->async([&] { ++counter; });
 
     std::atomic<bool> syncReturned{false};
@@ -216,7 +220,7 @@ TEST(WorkQueueTest, ItemRunningWhenSuspendedFinishesAndTheNextWaits) {
     Event started, release, firstDone, secondRan;
     queue->async([&] {
         started.set();
-        release.wait();
+        release.wait(kBlocked);
         firstDone.set();
     });
     queue->async([&] { secondRan.set(); });
@@ -320,7 +324,7 @@ TEST(WorkQueueTest, ReleasedQueueStillRunsPendingItemsInOrderThenGoes) {
     Event release;
     std::mutex mutex;
     std::vector<int> order;
-    queue->async([&] { release.wait(); });
+    queue->async([&] { release.wait(kBlocked); });
     for (int i = 0; i < 10; ++i) {
         queue->async([&, i] {
             std::lock_guard lock(mutex);
@@ -364,7 +368,7 @@ TEST(WorkQueueTest, BlockedHandlersDoNotStopOtherQueues) {
         peers.push_back(WorkQueue::makeSerial("test.peer." + std::to_string(i)));
         peers.back()->async([&] {
             ++blockedRunning;
-            release.wait();
+            release.wait(kBlocked);
             ++blockedDone;
         });
     }
@@ -402,7 +406,7 @@ TEST(ThreadPoolTest, GrowsWhileWorkWaitsUpToItsCapAndIdleWorkersExit) {
     for (int i = 0; i < 4; ++i) {
         pool.execute([&] {
             ++started;
-            release.wait();
+            release.wait(kBlocked);
             ++finished;
         });
     }
@@ -433,20 +437,24 @@ TEST(ThreadPoolTest, BurstOfShortItemsIsServedByTheWorkersThereAre) {
 }
 
 TEST(ThreadPoolTest, ItemsWaitingBehindBlockedWorkersGetNewWorkers) {
-    ThreadPool pool(
-        {.name = "test-stall", .maxThreads = 16, .immediateThreads = 1, .stallThreshold = 20ms});
+    ThreadPool pool({.name = "test-stall",
+                     .maxThreads = 16,
+                     .immediateThreads = 1,
+                     .stallThreshold = 20ms,
+                     .idleTimeout = 50ms});
     Event release;
     std::atomic<int> started{0};
     for (int i = 0; i < 6; ++i) {
         pool.execute([&] {
             ++started;
-            release.wait();
+            release.wait(kBlocked);
         });
     }
     EXPECT_TRUE(eventually([&] { return started.load() == 6; }))
         << "only " << started.load() << " blocked items started";
     // Later work is not held up either, once no spare worker is left and the
-    // monitor has nothing to watch.
+    // monitor has long had nothing to watch.
+    std::this_thread::sleep_for(100ms);
     EXPECT_TRUE(eventually([&] { return pool.threadCount() == 6 && pool.idleThreadCount() == 0; }));
     Event later;
     pool.execute([&] { later.set(); });
@@ -461,7 +469,7 @@ TEST(ThreadPoolTest, StoppingWaitsForRunningItemsAndDropsWaitingOnes) {
     std::atomic<bool> firstFinished{false};
     pool->execute([&] {
         started.set();
-        release.wait();
+        release.wait(kBlocked);
         firstFinished = true;
     });
     auto token = std::make_shared<int>(0);
