@@ -1,0 +1,270 @@
+// Who the relay says a peer is, against real processes: copies of this test
+// program act as clients (signed in the scratch root's registry or not) and
+// connect, exec, fork and exit while the server asks for their identity on
+// every request.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <string>
+
+#include "RelayTestServer.h"
+#include "ScratchDeviceRoot.h"
+#include "platform/CodeSigningRegistry.h"
+
+namespace berth {
+namespace {
+
+using test::dictionaryWith;
+using test::RelayTestServer;
+
+// ---------------------------------------------------------------------------
+// The client role. When this program is started with BERTH_RELAY_ROLE set it
+// does not run the tests: it connects to BERTH_RELAY_SOCKET (or keeps the
+// connection on descriptor BERTH_RELAY_FD it inherited) and obeys one command
+// per line of standard input, answering each on standard output:
+//   send <tag>   sends a request {"Tag": tag} and waits for its reply -> "ok"
+//   exec         execs BERTH_RELAY_EXEC in the same role, keeping the socket
+//   fork-exit    forks; the parent prints "forked <child pid>" and exits, the
+//                child goes on reading commands
+// It exits at the end of its input.
+
+int connectedSocket() {
+    if (const char* inherited = std::getenv("BERTH_RELAY_FD")) return std::atoi(inherited);
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);  // inherited across exec on purpose
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, std::getenv("BERTH_RELAY_SOCKET"), sizeof address.sun_path - 1);
+    if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) _exit(3);
+    return fd;
+}
+
+void answer(const std::string& line) {
+    std::printf("%s\n", line.c_str());
+    std::fflush(stdout);
+}
+
+[[noreturn]] void runClientRole() {
+    const int fd = connectedSocket();
+    answer("connected");
+    char line[256];
+    while (std::fgets(line, sizeof line, stdin)) {
+        std::string command(line);
+        if (!command.empty() && command.back() == '\n') command.pop_back();
+        if (command.rfind("send ", 0) == 0) {
+            const uint64_t tag = std::strtoull(command.c_str() + 5, nullptr, 10);
+            if (!test::writeAll(fd, test::frameBytes(relay::FrameKind::Request, tag,
+                                                     dictionaryWith("Tag", tag))))
+                _exit(4);
+            answer(test::readFrames(fd, 1).size() == 1 ? "ok" : "no reply");
+        } else if (command == "exec") {
+            const std::string fdText = std::to_string(fd);
+            ::setenv("BERTH_RELAY_FD", fdText.c_str(), 1);
+            const char* path = std::getenv("BERTH_RELAY_EXEC");
+            ::execl(path, path, nullptr);
+            _exit(5);
+        } else if (command == "fork-exit") {
+            const pid_t child = ::fork();
+            if (child != 0) {
+                answer("forked " + std::to_string(child));
+                _exit(0);
+            }
+        }
+    }
+    _exit(0);
+}
+
+// Runs before anything else of the program when it is a client.
+[[maybe_unused]] const bool kIsClient = [] {
+    if (std::getenv("BERTH_RELAY_ROLE")) runClientRole();
+    return false;
+}();
+
+[[maybe_unused]] const auto& kRoot = test::installScratchDeviceRoot();
+
+// ---------------------------------------------------------------------------
+
+// A client process started from `executable` in the client role, driven
+// through pipes. Killed and reaped when the object goes, if still running.
+class ClientProcess {
+  public:
+    ClientProcess(const std::filesystem::path& executable, const std::filesystem::path& socket,
+                  const std::filesystem::path& execTarget = {}) {
+        int toChild[2], fromChild[2];
+        if (::pipe2(toChild, O_CLOEXEC) != 0 || ::pipe2(fromChild, O_CLOEXEC) != 0) return;
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            ::dup2(toChild[0], STDIN_FILENO);
+            ::dup2(fromChild[1], STDOUT_FILENO);
+            ::setenv("BERTH_RELAY_ROLE", "client", 1);
+            ::setenv("BERTH_RELAY_SOCKET", socket.c_str(), 1);
+            ::unsetenv("BERTH_RELAY_FD");
+            if (!execTarget.empty()) ::setenv("BERTH_RELAY_EXEC", execTarget.c_str(), 1);
+            ::execl(executable.c_str(), executable.c_str(), nullptr);
+            _exit(127);
+        }
+        ::close(toChild[0]);
+        ::close(fromChild[1]);
+        input_ = ::fdopen(toChild[1], "w");
+        output_ = ::fdopen(fromChild[0], "r");
+    }
+    ~ClientProcess() {
+        if (input_) std::fclose(input_);
+        if (output_) std::fclose(output_);
+        if (pid_ > 0 && !reaped_) {
+            ::kill(pid_, SIGKILL);
+            ::waitpid(pid_, nullptr, 0);
+        }
+    }
+
+    pid_t pid() const { return pid_; }
+
+    // Sends a command line, returns the answer line ("" at end of output).
+    std::string command(const std::string& line) {
+        std::fprintf(input_, "%s\n", line.c_str());
+        std::fflush(input_);
+        return readLine();
+    }
+    std::string readLine() {
+        char buffer[256];
+        if (!std::fgets(buffer, sizeof buffer, output_)) return "";
+        std::string text(buffer);
+        if (!text.empty() && text.back() == '\n') text.pop_back();
+        return text;
+    }
+    // Waits for the process started here to exit.
+    void reap() {
+        ::waitpid(pid_, nullptr, 0);
+        reaped_ = true;
+    }
+
+  private:
+    pid_t pid_ = -1;
+    FILE* input_ = nullptr;
+    FILE* output_ = nullptr;
+    bool reaped_ = false;
+};
+
+Value entitlementsAllowing(const char* key) {
+    return dictionaryWith(key, true);
+}
+
+class RelayIdentityTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        BERTH_REQUIRE_ROOT();
+        unsigned_ = std::filesystem::read_symlink("/proc/self/exe");
+        signed_ = bin_ / "signed-client";
+        std::filesystem::copy_file(unsigned_, signed_);
+        std::filesystem::permissions(signed_, std::filesystem::perms(0755));
+        sign(entitlementsAllowing("sys.kelp.private.Berth.allowed"));
+
+        server_ = std::make_unique<RelayTestServer>(
+            [this](const RelayEvent& event, RelayReply&) {
+                const Value* tag = event.message().find("Tag");
+                std::lock_guard lock(mutex_);
+                seen_[tag ? *tag->uint64Value() : 0] = event.connection()->peerIdentity();
+                return true;
+            },
+            RelayLimits{}, registry_);
+    }
+
+    void sign(const Value& entitlements) {
+        std::string why;
+        ASSERT_EQ(registry_->sign(signed_, "sys.kelp.test.client", entitlements, &why), 0) << why;
+    }
+
+    RelayPeerIdentity seen(uint64_t tag) {
+        std::lock_guard lock(mutex_);
+        return seen_.at(tag);
+    }
+
+    test::ScratchDir bin_;
+    std::filesystem::path unsigned_;
+    std::filesystem::path signed_;
+    std::shared_ptr<CodeSigningRegistry> registry_ = std::make_shared<CodeSigningRegistry>();
+    std::unique_ptr<RelayTestServer> server_;
+    std::mutex mutex_;
+    std::map<uint64_t, RelayPeerIdentity> seen_;
+};
+
+TEST_F(RelayIdentityTest, ASignedPeerIsIdentifiedAfreshOnEveryRequest) {
+    ClientProcess client(signed_, server_->path());
+    ASSERT_EQ(client.readLine(), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+
+    RelayPeerIdentity first = seen(1);
+    EXPECT_TRUE(first.processStillBound) << first.signingError;
+    EXPECT_EQ(first.pid, client.pid());
+    EXPECT_EQ(first.effectiveUserId, 0u);
+    EXPECT_EQ(first.groupId, 0u);
+    EXPECT_EQ(first.signingIdentifier, "sys.kelp.test.client");
+    EXPECT_EQ(first.entitlements, entitlementsAllowing("sys.kelp.private.Berth.allowed"));
+
+    // Entitlements changed in the registry apply to the next request of a
+    // connection already open.
+    sign(entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
+    ASSERT_EQ(client.command("send 2"), "ok");
+    EXPECT_EQ(seen(2).entitlements, entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
+}
+
+TEST_F(RelayIdentityTest, AnUnsignedPeerIsServedWithoutIdentifierOrEntitlements) {
+    ClientProcess client(unsigned_, server_->path());
+    ASSERT_EQ(client.readLine(), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+    RelayPeerIdentity identity = seen(1);
+    EXPECT_TRUE(identity.processStillBound) << identity.signingError;
+    EXPECT_EQ(identity.pid, client.pid());
+    EXPECT_FALSE(identity.signingIdentifier);
+    EXPECT_FALSE(identity.entitlements);
+    EXPECT_FALSE(identity.signingError.empty());
+}
+
+TEST_F(RelayIdentityTest, APeerThatExecsASignedProgramAfterConnectingGainsNothing) {
+    ClientProcess client(unsigned_, server_->path(), signed_);
+    ASSERT_EQ(client.readLine(), "connected");
+    // The connection is bound to the unsigned program once accepted.
+    ASSERT_TRUE(server_->waitFor([&] { return server_->listener().connectionCount() == 1; }));
+    ASSERT_EQ(client.command("exec"), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+
+    RelayPeerIdentity identity = seen(1);
+    EXPECT_EQ(identity.pid, client.pid());
+    EXPECT_FALSE(identity.processStillBound);
+    EXPECT_FALSE(identity.signingIdentifier);
+    EXPECT_FALSE(identity.entitlements);
+    EXPECT_NE(identity.signingError.find("another executable"), std::string::npos)
+        << identity.signingError;
+}
+
+TEST_F(RelayIdentityTest, ASocketOutlivingTheProcessThatConnectedCarriesNoIdentity) {
+    ClientProcess client(signed_, server_->path());
+    ASSERT_EQ(client.readLine(), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+    ASSERT_EQ(seen(1).signingIdentifier, "sys.kelp.test.client");
+
+    // The connecting process hands the socket to a child (running the same
+    // signed program) and exits.
+    const std::string forked = client.command("fork-exit");
+    ASSERT_EQ(forked.rfind("forked ", 0), 0u) << forked;
+    client.reap();
+    ASSERT_EQ(client.command("send 2"), "ok");
+
+    RelayPeerIdentity identity = seen(2);
+    EXPECT_EQ(identity.pid, client.pid());
+    EXPECT_FALSE(identity.processStillBound);
+    EXPECT_FALSE(identity.signingIdentifier);
+    EXPECT_FALSE(identity.entitlements);
+    EXPECT_NE(identity.signingError.find("exited"), std::string::npos) << identity.signingError;
+}
+
+}  // namespace
+}  // namespace berth
