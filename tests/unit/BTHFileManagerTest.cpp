@@ -8,7 +8,9 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cctype>
 #include <filesystem>
+#include <functional>
 #include <set>
 
 #include "TestSupport.h"
@@ -153,6 +155,116 @@ TEST(BTHFileManagerCreateDirectory, NeverCreatesOrChangesAnythingThroughALink) {
     EXPECT_FALSE(manager().createDirectoryAtURLWithClass(dir / "link", false, 0755, 3, &error));
     EXPECT_TRUE(error && error->isPOSIXError(ELOOP));
     EXPECT_EQ(classOf(outside.path()), 0);
+}
+
+TEST(BTHFileManagerTemporaryDirectory, MakesAFreshPrivateDirectoryPerCall) {
+    ScratchDir dir;
+    BTHErrorRef error = BTHCreatePOSIXError("earlier", 1, EIO, "left over");
+    std::set<std::string> names;
+    for (int i = 0; i < 20; ++i) {
+        auto made = manager().createTemporaryDirectoryInDirectoryURL(dir.path(), &error);
+        ASSERT_TRUE(made);
+        EXPECT_FALSE(error);  // cleared, even on success
+        EXPECT_TRUE(made->isDirectory);
+        EXPECT_EQ(made->path.parent_path(), dir.path());
+        const std::string name = made->path.filename();
+        ASSERT_EQ(name.size(), 11u) << name;
+        EXPECT_EQ(name.substr(0, 5), "temp.");
+        for (char c : name.substr(5)) EXPECT_TRUE(std::isalnum(static_cast<unsigned char>(c)));
+        struct stat st = lstatOf(made->path);
+        EXPECT_TRUE(S_ISDIR(st.st_mode));
+        EXPECT_EQ(st.st_mode & 077, 0u);
+        names.insert(name);
+    }
+    EXPECT_EQ(names.size(), 20u);
+
+    auto prefixed =
+        manager().createTemporaryDirectoryInDirectoryURL(dir.path(), "sys.kelp.Assets.", &error);
+    ASSERT_TRUE(prefixed);
+    EXPECT_EQ(prefixed->path.filename().string().rfind("sys.kelp.Assets.", 0), 0u);
+
+    EXPECT_FALSE(manager().createTemporaryDirectoryInDirectoryURL(dir / "missing", &error));
+    expectPOSIXError(
+        error, ENOENT,
+        "Failed to create temp dir at path " + (dir / "missing/temp.XXXXXX").string() + " : " +
+            strerror(ENOENT),
+        "-[BTHFileManager createTemporaryDirectoryInDirectoryURL:withNamePrefix:error:]");
+}
+
+TEST(BTHFileManagerListing, ListsVisibleNamesAndFlagsDirectories) {
+    ScratchDir dir;
+    stdfs::create_directories(dir / "sub");
+    stdfs::create_directories(dir / ".hidden-dir");
+    test::writeFile(dir / "file", "");
+    test::writeFile(dir / ".hidden", "");
+    stdfs::create_directory_symlink(dir / "sub", dir / "dirlink");
+    test::LogCapture log;
+    BTHErrorRef error;
+    auto items = manager().urlsForItemsInDirectoryAtURL(dir.path(), &error);
+    ASSERT_TRUE(items);
+    std::vector<BTHFileURL> sorted = *items;
+    std::sort(sorted.begin(), sorted.end(),
+              [](const BTHFileURL& a, const BTHFileURL& b) { return a.path < b.path; });
+    const std::vector<BTHFileURL> expected = {
+        {dir / "dirlink", false}, {dir / "file", false}, {dir / "sub", true}};
+    EXPECT_EQ(sorted, expected);
+
+    // A missing directory fails quietly; any other failure is logged.
+    EXPECT_FALSE(manager().urlsForItemsInDirectoryAtURL(dir / "missing", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIXError(ENOENT));
+    EXPECT_TRUE(log.lines().empty());
+    EXPECT_FALSE(manager().urlsForItemsInDirectoryAtURL(dir / "file", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIXError(ENOTDIR));
+    const std::string line =
+        "opendir of " + (dir / "file").string() + " failed: " + strerror(ENOTDIR);
+    ASSERT_EQ(log.count(BTHLogLevelError, line), 1u);
+    EXPECT_EQ(log.lines().back().function, "_IterateDirectory");
+}
+
+// Runs `body` in a child process under `uid` and gives its exit status.
+int runAsUser(uid_t uid, const std::function<int()>& body) {
+    pid_t pid = ::fork();
+    if (pid == 0) {
+        if (::setresgid(uid, uid, uid) != 0 || ::setresuid(uid, uid, uid) != 0) ::_exit(100);
+        ::_exit(body());
+    }
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 200;
+}
+
+TEST(BTHFileManagerExistence, TheTwoTestsAgreeOnlyWhenTheAnswerIsKnown) {
+    BERTH_REQUIRE_ROOT();
+    ScratchDir dir;
+    ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
+    test::writeFile(dir / "file", "");
+    stdfs::create_symlink(dir / "nowhere", dir / "dangling");
+    for (const char* present : {"file", "dangling"}) {
+        EXPECT_TRUE(manager().itemExistsAtURL(dir / present)) << present;
+        EXPECT_FALSE(manager().itemDoesNotExistAtURL(dir / present)) << present;
+    }
+    test::LogCapture log;
+    EXPECT_FALSE(manager().itemExistsAtURL(dir / "missing"));
+    EXPECT_TRUE(manager().itemDoesNotExistAtURL(dir / "missing"));
+    EXPECT_TRUE(log.lines().empty());
+
+    // Behind a directory the caller may not search: neither answer is true,
+    // and both say why.
+    stdfs::create_directories(dir / "closed");
+    test::writeFile(dir / "closed/item", "");
+    ASSERT_EQ(::chmod((dir / "closed").c_str(), 0700), 0);
+    const stdfs::path hidden = dir / "closed/item";
+    const int status = runAsUser(65534, [&] {
+        test::LogCapture childLog;
+        if (manager().itemExistsAtURL(hidden)) return 1;
+        if (manager().itemDoesNotExistAtURL(hidden)) return 2;
+        const std::string line =
+            "Failed to determine if " + hidden.string() + " exists: " + strerror(EACCES);
+        return childLog.count(BTHLogLevelError, line) == 2 ? 0 : 3;
+    });
+    EXPECT_EQ(status, 0);
 }
 
 }  // namespace
