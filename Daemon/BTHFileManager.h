@@ -52,13 +52,18 @@ class BTHFileManager {
     // Removes a file, link or directory tree. A missing item anywhere is not
     // a failure. Items that cannot be removed are passed over; an immutable
     // item has its flag cleared and is unlinked (logged at notice level).
-    // Fails with the first error number recorded.
+    // Fails with the first error number recorded ("removefile of %@ failed:
+    // %s"); a vanished item recorded first hides later errors. Directories
+    // on another file system are not entered (EXDEV).
     bool removeItemAtURL(const std::filesystem::path& url, BTHErrorRef* error);
 
     // Creates the directory (and with `intermediates` its missing parents)
-    // with `mode`. An existing directory is accepted and keeps its mode.
-    // Then, unless `protectionClass` is -1, sets its protection class, and
-    // unless `owner` is 0, chowns it to owner:owner (result ignored).
+    // with `mode` (less the process's umask), each component made relative
+    // to its parent's descriptor; no existing component may be a link
+    // (ELOOP). An existing item at the path is accepted and keeps its mode.
+    // Then, unless `protectionClass` is -1, sets the class of the opened
+    // directory, and unless `owner` is 0, chowns it to owner:owner (result
+    // ignored).
     bool createDirectoryAtURL(const std::filesystem::path& url, bool intermediates, mode_t mode,
                               uid_t owner, int32_t protectionClass, BTHErrorRef* error);
     bool createDirectoryAtURL(const std::filesystem::path& url, bool intermediates, mode_t mode,
@@ -69,7 +74,9 @@ class BTHFileManager {
                               BTHErrorRef* error);
 
     // Copies a tree keeping data, mode, owner, times, extended attributes
-    // (ACLs included), flags and links (copied as links).
+    // (ACLs included), flags and links (copied as links). Stops at the first
+    // item that fails; a destination the copy created is then removed. The
+    // IfExists form succeeds without doing anything for a missing source.
     bool copyItemAtURL(const std::filesystem::path& source, const std::filesystem::path& dest,
                        BTHErrorRef* error);
     bool copyItemIfExistsAtURL(const std::filesystem::path& source,
@@ -82,7 +89,8 @@ class BTHFileManager {
     bool moveItemIfExistsAtURL(const std::filesystem::path& source,
                                const std::filesystem::path& dest, BTHErrorRef* error);
 
-    // Creates "<prefix>XXXXXX" (unique suffix, mode 0700) in `parent`.
+    // Creates "<prefix>XXXXXX" (six random letters and digits, mode 0700) in
+    // `parent` and returns it as a directory URL. Clears `*error` first.
     std::optional<BTHFileURL> createTemporaryDirectoryInDirectoryURL(
         const std::filesystem::path& parent, const std::string& prefix, BTHErrorRef* error);
     std::optional<BTHFileURL> createTemporaryDirectoryInDirectoryURL(
@@ -91,18 +99,22 @@ class BTHFileManager {
     // Walks the tree at `root` without following links or crossing into
     // other file systems, pre- and post-order, in directory order. The
     // callback answers whether to go on; false ends the walk with failure and
-    // the error the callback left in its slot.
+    // the error the callback left in its slot. An item that cannot be
+    // lstat'ed (a missing root, an entry that vanished) ends the walk with
+    // "Error for path %s: %s"; an unreadable directory is delivered instead.
     using WalkCallback = std::function<bool(const BTHWalkEntry& entry, BTHErrorRef* error)>;
     bool traverseDirectory(const std::filesystem::path& root, BTHErrorRef* error,
                            const WalkCallback& callback);
 
     // The items of a directory in directory order, names beginning with "."
-    // skipped, directories flagged.
+    // skipped, directories flagged (a link is never flagged, whatever it
+    // points to). A missing directory fails with ENOENT without a log line.
     std::optional<std::vector<BTHFileURL>> urlsForItemsInDirectoryAtURL(
         const std::filesystem::path& directory, BTHErrorRef* error);
 
-    // lstat-based (a dangling link exists). Not complements: when existence
-    // cannot be determined both answer false.
+    // lstat-based (a dangling link exists); a link in an earlier component
+    // is not followed (ELOOP). Not complements: when existence cannot be
+    // determined both answer false and log why.
     bool itemExistsAtURL(const std::filesystem::path& url);
     bool itemDoesNotExistAtURL(const std::filesystem::path& url);
 
