@@ -1,5 +1,6 @@
 // The link-safe toolkit: no link followed in any component, items checked
-// against what lstat saw, paths made one component at a time.
+// against what lstat saw. (Making paths is covered through directory
+// creation in the file manager's tests.)
 #include "platform/SafeFs.h"
 
 #include <fcntl.h>
@@ -8,7 +9,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <set>
 #include <string>
 
 #include "TestSupport.h"
@@ -18,48 +18,6 @@ namespace {
 
 namespace stdfs = std::filesystem;
 using test::ScratchDir;
-
-TEST(SafeFsTest, SplitParentNamesTheLastComponent) {
-    struct Case {
-        const char* path;
-        const char* parent;
-        const char* name;
-    };
-    for (const Case& c : {Case{"/a/b", "/a", "b"}, Case{"/a/b//", "/a", "b"}, Case{"/a", "/", "a"},
-                          Case{"rel", ".", "rel"}}) {
-        stdfs::path parent;
-        std::string name;
-        ASSERT_TRUE(fs::splitParent(c.path, &parent, &name)) << c.path;
-        EXPECT_EQ(parent, c.parent) << c.path;
-        EXPECT_EQ(name, c.name) << c.path;
-    }
-    for (const char* bad : {"/", "", "/a/..", "/a/."}) {
-        stdfs::path parent;
-        std::string name;
-        EXPECT_FALSE(fs::splitParent(bad, &parent, &name)) << bad;
-        EXPECT_EQ(errno, EINVAL);
-    }
-}
-
-TEST(SafeFsTest, MakePathCreatesEachMissingComponentAndNeverGoesThroughALink) {
-    ScratchDir dir;
-    ScratchDir outside;
-    const mode_t oldMask = ::umask(0);
-    EXPECT_EQ(fs::makePath(dir / "a/b/c", 0711), 0);
-    ::umask(oldMask);
-    struct stat st;
-    ASSERT_EQ(::lstat((dir / "a/b").c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode & 07777, 0711u);
-    EXPECT_EQ(fs::makePath(dir / "a/b/c", 0755), EEXIST);
-    test::writeFile(dir / "file", "");
-    EXPECT_EQ(fs::makePath(dir / "file", 0755), EEXIST);  // whatever is there
-    EXPECT_EQ(fs::makePath(dir / "file/below", 0755), ENOTDIR);
-
-    stdfs::create_directory_symlink(outside.path(), dir / "link");
-    EXPECT_EQ(fs::makePath(dir / "link/x/y", 0755), ELOOP);
-    EXPECT_EQ(fs::makePath(dir / "link/x", 0755), ELOOP);
-    EXPECT_TRUE(stdfs::is_empty(outside.path()));
-}
 
 TEST(SafeFsTest, OpeningAndRenamingRefuseLinksInAnyComponent) {
     ScratchDir dir;
@@ -122,22 +80,6 @@ TEST(SafeFsTest, CheckedOpensRefuseAnItemOtherThanTheOneSeen) {
     ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
     ASSERT_EQ(::fstatat(parent.get(), "fifo", &seen, AT_SYMLINK_NOFOLLOW), 0);
     EXPECT_FALSE(fs::openItemChecked(parent.get(), "fifo", seen));  // never opened
-}
-
-TEST(SafeFsTest, DirReaderSkipsDotEntriesAndLeavesTheCallersDescriptorAlone) {
-    ScratchDir dir;
-    for (const char* f : {"a", ".hidden", "b"}) test::writeFile(dir / f, "");
-    UniqueFd fd = fs::openNoFollow(dir.path(), O_RDONLY | O_DIRECTORY);
-    for (int pass = 0; pass < 2; ++pass) {  // each reader starts from the beginning
-        fs::DirReader reader(fd.get());
-        ASSERT_TRUE(reader.valid());
-        std::set<std::string> seen;
-        while (const struct dirent* e = reader.next()) seen.insert(e->d_name);
-        EXPECT_EQ(errno, 0);
-        EXPECT_EQ(seen, (std::set<std::string>{"a", ".hidden", "b"}));
-    }
-    struct stat st;
-    EXPECT_EQ(::fstatat(fd.get(), "a", &st, 0), 0);
 }
 
 }  // namespace
