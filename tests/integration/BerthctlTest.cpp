@@ -1,0 +1,224 @@
+// berthctl against a real daemon on a scratch device root, run as a child
+// process the way an administrator or a script runs it: what it prints, the
+// exit status, and what it changes on the device root.
+#include <fcntl.h>
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "DaemonProcess.h"
+#include "ScratchDeviceRoot.h"
+#include "TestSupport.h"
+#include "core/ValueJson.h"
+#include "platform/CodeSigningRegistry.h"
+#include "platform/LockStateNotification.h"
+#include "platform/UniqueFd.h"
+
+namespace berth {
+namespace {
+
+const std::filesystem::path& root() {
+    static const std::filesystem::path& path = test::installScratchDeviceRoot();
+    return path;
+}
+const bool kRootInstalled = !root().empty();
+
+const std::filesystem::path kBerthctl = BERTHCTL_BINARY_PATH;
+constexpr uid_t kNobody = 65534;
+
+struct Outcome {
+    int status = -1;
+    std::string out;
+    std::string err;
+};
+
+// Runs `program` with `args` (BERTH_ROOT inherited), as `user` when given,
+// and collects its output and exit status.
+Outcome run(const std::filesystem::path& program, const std::vector<std::string>& args,
+            std::optional<uid_t> user = std::nullopt) {
+    test::ScratchDir outputs;
+    UniqueFd out(::open((outputs / "out").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+    UniqueFd err(::open((outputs / "err").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+    std::vector<std::string> strings{program.string()};
+    strings.insert(strings.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& s : strings) argv.push_back(s.data());
+    argv.push_back(nullptr);
+
+    Outcome result;
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+        ::dup2(out.get(), STDOUT_FILENO);
+        ::dup2(err.get(), STDERR_FILENO);
+        if (user && (::setgroups(0, nullptr) != 0 || ::setgid(*user) != 0 || ::setuid(*user) != 0))
+            _exit(126);
+        ::execv(argv[0], argv.data());
+        _exit(127);
+    }
+    int status = 0;
+    if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return result;
+    result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    result.out = test::readFile(outputs / "out");
+    result.err = test::readFile(outputs / "err");
+    return result;
+}
+
+Outcome berthctl(const std::vector<std::string>& args, std::optional<uid_t> user = std::nullopt) {
+    return run(kBerthctl, args, user);
+}
+
+// The "ReplyError" of a reply printed by `send`; 0 when there is none.
+uint64_t printedReplyError(const Outcome& sent) {
+    std::string why;
+    std::optional<Value> reply = valueFromJson(sent.out, &why);
+    EXPECT_TRUE(reply) << why << "\n" << sent.out << sent.err;
+    const Value* code = reply ? reply->find("ReplyError") : nullptr;
+    return code ? code->uint64Value().value_or(0) : 0;
+}
+
+std::string trimmed(std::string text) {
+    while (!text.empty() && std::isspace(static_cast<unsigned char>(text.back()))) text.pop_back();
+    return text;
+}
+
+class BerthctlTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        BERTH_REQUIRE_ROOT();
+        ASSERT_TRUE(kRootInstalled);
+    }
+
+    // Starts the daemon on the scratch root and waits until it serves.
+    void startDaemon() {
+        daemon_.emplace(root());
+        ASSERT_TRUE(daemon_->waitUntilServing()) << daemon_->standardError();
+    }
+
+    std::optional<test::DaemonProcess> daemon_;
+};
+
+TEST_F(BerthctlTest, SendPrintsTheReplyAndExitsByItsCode) {
+    ASSERT_NO_FATAL_FAILURE(startDaemon());
+
+    const Outcome invalid = berthctl({"send", R"({"Command": 30})"});
+    EXPECT_EQ(invalid.status, 1) << invalid.err;
+    EXPECT_EQ(trimmed(invalid.err), "error: BTHErrorInvalidCommand (49)");
+    EXPECT_EQ(printedReplyError(invalid), 49u);
+
+    // --json prints the same reply on a single line, for scripts.
+    const Outcome compact = berthctl({"--json", "send", R"({"Command": {"uint64": 30}})"});
+    EXPECT_EQ(compact.status, 1);
+    EXPECT_EQ(std::count(compact.out.begin(), compact.out.end(), '\n'), 1) << compact.out;
+    EXPECT_EQ(printedReplyError(compact), 49u);
+
+    // A request that is not a dictionary never reaches the daemon.
+    const Outcome notARequest = berthctl({"send", "[30]"});
+    EXPECT_EQ(notARequest.status, 64);
+    EXPECT_TRUE(notARequest.out.empty());
+}
+
+TEST_F(BerthctlTest, EntitlementsFollowTheSignatureOfTheRunningProgram) {
+    ASSERT_NO_FATAL_FAILURE(startDaemon());
+    // An identical copy elsewhere is another program as far as the registry
+    // is concerned: it stays unsigned.
+    test::ScratchDir dir;
+    ::chmod(dir.path().c_str(), 0755);
+    const auto unsignedCopy = dir / "berthctl";
+    std::filesystem::copy_file(kBerthctl, unsignedCopy);
+
+    const Outcome signedNow =
+        berthctl({"sign", kBerthctl.string(), "sys.kelp.berthctl.test", "--entitlements",
+                  R"({"sys.kelp.private.Berth.allowed": true})"});
+    ASSERT_EQ(signedNow.status, 0) << signedNow.err;
+    const auto entry = CodeSigningRegistry().entryFor(std::filesystem::canonical(kBerthctl));
+    ASSERT_TRUE(entry);
+    EXPECT_EQ(entry->identifier, "sys.kelp.berthctl.test");
+    EXPECT_EQ(*entry->entitlements.find("sys.kelp.private.Berth.allowed"), Value(true));
+
+    const Outcome refused = run(unsignedCopy, {"send", R"({"Command": 1})"});
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(trimmed(refused.err), "error: BTHErrorNotEntitled (55)");
+    EXPECT_EQ(printedReplyError(refused), 55u);
+
+    const Outcome admitted = berthctl({"send", R"({"Command": 1})"});
+    EXPECT_NE(printedReplyError(admitted), 55u) << admitted.err;
+    EXPECT_NE(admitted.status, 2) << admitted.err;
+
+    // Without its entry the same program is a stranger again.
+    const Outcome removed = berthctl({"sign", "--remove", kBerthctl.string()});
+    ASSERT_EQ(removed.status, 0) << removed.err;
+    EXPECT_FALSE(CodeSigningRegistry().entryFor(std::filesystem::canonical(kBerthctl)));
+    EXPECT_EQ(printedReplyError(berthctl({"send", R"({"Command": 1})"})), 55u);
+}
+
+TEST_F(BerthctlTest, DaemonThatCannotBeAskedIsExitStatusTwo) {
+    test::ScratchDir dir;
+    const Outcome absent = berthctl({"send", "--socket", (dir / "none").string(), "{}"});
+    EXPECT_EQ(absent.status, 2);
+    EXPECT_NE(absent.err.find("not running"), std::string::npos) << absent.err;
+
+    // A socket that takes the request but never answers.
+    const auto path = dir / "silent";
+    UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::listen(listener.get(), 4), 0);
+    const Outcome silent =
+        berthctl({"send", "--socket", path.string(), "--timeout", "0.3", R"({"Command": 1})"});
+    EXPECT_EQ(silent.status, 2);
+    EXPECT_TRUE(silent.out.empty());
+    EXPECT_FALSE(silent.err.empty());
+}
+
+TEST_F(BerthctlTest, LockAndUnlockWriteTheKeyBagState) {
+    const auto stateFile = root() / "run/berthd/lockstate";
+    ASSERT_EQ(berthctl({"lock"}).status, 0);
+    EXPECT_EQ(trimmed(test::readFile(stateFile)), "1");
+    EXPECT_EQ(LockStateNotification::lockState(), 1);
+    ASSERT_EQ(berthctl({"unlock"}).status, 0);
+    EXPECT_EQ(trimmed(test::readFile(stateFile)), "0");
+    EXPECT_EQ(LockStateNotification::lockState(), 0);
+}
+
+TEST_F(BerthctlTest, OnlyRootChangesTheSigningRegistry) {
+    const auto canonical = std::filesystem::canonical(kBerthctl);
+    const Outcome asNobody =
+        berthctl({"sign", kBerthctl.string(), "sys.kelp.intruder", "--entitlements",
+                  R"({"sys.kelp.private.Berth.allowed": true})"},
+                 kNobody);
+    EXPECT_EQ(asNobody.status, 1) << asNobody.err;
+    EXPECT_NE(asNobody.err.find("root"), std::string::npos) << asNobody.err;
+    EXPECT_FALSE(CodeSigningRegistry().entryFor(canonical));
+
+    // Nor may another user remove what root signed.
+    ASSERT_EQ(berthctl({"sign", kBerthctl.string(), "sys.kelp.berthctl.test"}).status, 0);
+    EXPECT_EQ(berthctl({"sign", "--remove", kBerthctl.string()}, kNobody).status, 1);
+    EXPECT_TRUE(CodeSigningRegistry().entryFor(canonical));
+    ASSERT_EQ(berthctl({"sign", "--remove", kBerthctl.string()}).status, 0);
+}
+
+TEST_F(BerthctlTest, CommandsListsEveryCommandWithItsEntitlement) {
+    const Outcome listed = berthctl({"--json", "commands"});
+    ASSERT_EQ(listed.status, 0);
+    std::optional<Value> rows = valueFromJson(listed.out);
+    ASSERT_TRUE(rows && rows->isArray()) << listed.out;
+    ASSERT_EQ(rows->size(), 30u);
+    const Value::Array& table = *rows->arrayValue();
+    for (size_t i = 0; i < table.size(); ++i)
+        EXPECT_EQ(*table[i].find("command"), Value(uint64_t{i}));
+    EXPECT_EQ(*table[24].find("entitlement"), Value("sys.kelp.private.Berth.dataMigration"));
+    EXPECT_EQ(*table[4].find("repliesAtOnce"), Value(false));
+}
+
+}  // namespace
+}  // namespace berth
