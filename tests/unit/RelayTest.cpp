@@ -1,11 +1,16 @@
 // The relay's server side driven by real clients over a Unix socket: order
 // of delivery, parallel peers, peers that leave, broken and flooding peers,
 // and many peers at once.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 
 #include <atomic>
+#include <condition_variable>
+#include <filesystem>
 #include <future>
+#include <map>
 #include <random>
 #include <thread>
 
@@ -169,6 +174,195 @@ TEST(RelayTest, AMessageWithoutReplyContextLetsTheHandlerCancelThePeer) {
     EXPECT_EQ(error.code, BerthError::Code::ConnectionClosed) << error.message;
     EXPECT_TRUE(server.waitFor([&] { return server.invalidated() == 1; }));
     EXPECT_TRUE(server.logged("cancelled"));
+}
+
+// A frame header declaring `length` body bytes, with the given magic,
+// version and kind bytes.
+std::vector<uint8_t> header(uint32_t length, uint8_t kind = 1, uint8_t version = 1,
+                            uint8_t magic = 0x42) {
+    std::vector<uint8_t> bytes = {magic, 0x52, version, kind, 7, 0, 0, 0, 0, 0, 0, 0};
+    for (int shift = 0; shift < 32; shift += 8) bytes.push_back(uint8_t(length >> shift));
+    return bytes;
+}
+
+std::vector<uint8_t> frameWithBody(std::vector<uint8_t> body, uint8_t kind = 1) {
+    std::vector<uint8_t> bytes = header(static_cast<uint32_t>(body.size()), kind);
+    bytes.insert(bytes.end(), body.begin(), body.end());
+    return bytes;
+}
+
+// Threads of this process.
+size_t threadCount() {
+    size_t count = 0;
+    for ([[maybe_unused]] const auto& entry :
+         std::filesystem::directory_iterator("/proc/self/task"))
+        ++count;
+    return count;
+}
+
+TEST(RelayTest, ABrokenFrameDropsItsConnectionAndNothingElse) {
+    RelayTestServer server(echoWithArrivalOrder());
+    auto bystander = connectTo(server);
+    ASSERT_TRUE(bystander);
+
+    std::mt19937 random(20240611);
+    std::vector<uint8_t> noise(4096);
+    for (auto& byte : noise) byte = static_cast<uint8_t>(random());
+    noise[0] = 0x00;  // never the magic
+
+    std::vector<uint8_t> deep;
+    for (int level = 0; level <= relay::kMaxDepth; ++level)
+        deep.insert(deep.end(), {0x0A, 1, 0, 0, 0});  // an array of one element...
+    deep.push_back(0x00);                             // ...down to a null
+
+    std::vector<uint8_t> badVersion = header(1, 1, 9);
+    badVersion.push_back(0x00);
+
+    struct Case {
+        const char* name;
+        std::vector<uint8_t> bytes;
+        const char* logged;
+    } const cases[] = {
+        {"random bytes", noise, "not a relay stream"},
+        {"unknown version", badVersion, "unsupported relay version"},
+        {"a string running past its body", frameWithBody({0x06, 100, 0, 0, 0, 'a', 'b'}),
+         "truncated value"},
+        {"a body above the limit", header(relay::kMaxBodySize + 1), "body too large"},
+        {"nesting above the limit", frameWithBody(deep), "nesting too deep"},
+        {"keys out of order",
+         frameWithBody({0x0B, 2, 0, 0, 0, 1, 0, 0, 0, 'b', 0x00, 1, 0, 0, 0, 'a', 0x00}), "order"},
+        {"a reply sent by a client", frameWithBody({0x00}, 2), "reply frame"},
+    };
+    for (const Case& bad : cases) {
+        SCOPED_TRACE(bad.name);
+        UniqueFd peer = server.connectRaw();
+        ASSERT_TRUE(test::writeAll(peer.get(), bad.bytes));
+        // No reply: the stream just ends. (An oversized body is refused
+        // from its header alone; it is never sent.)
+        EXPECT_TRUE(test::readsEndOfStream(peer.get()));
+        EXPECT_TRUE(server.waitFor([&] { return server.logged(bad.logged); }));
+
+        BerthError error;
+        auto reply = bystander->request(dictionaryWith("Seq", uint64_t{5}), 20s, &error);
+        ASSERT_TRUE(reply) << error.message;
+        EXPECT_EQ(numberAt(*reply, "Seq"), 5u);
+    }
+    EXPECT_TRUE(server.logged("protocol error"));
+}
+
+TEST(RelayTest, AFloodingPeerIsHeldBackNotBufferedAndLosesNothing) {
+    std::promise<void> release;
+    std::shared_future<void> released = release.get_future().share();
+    RelayLimits limits;
+    limits.maxQueuedRequests = 4;
+    RelayTestServer server(
+        [&](const RelayEvent& event, RelayReply& reply) {
+            const uint64_t seq = numberAt(event.message(), "Seq");
+            if (seq == 0) released.wait();
+            reply.body().set("Seq", seq);
+            return true;
+        },
+        limits);
+    UniqueFd flooder = server.connectRaw();
+    ::fcntl(flooder.get(), F_SETFL, O_NONBLOCK);
+
+    // While the first request is held, the peer writes until the daemon
+    // stops taking its bytes for good (a full socket that does not drain
+    // within a second). An unbounded server would swallow all of them.
+    constexpr uint64_t kMostAttempted = 1'000'000;
+    uint64_t sent = 0;
+    bool heldBack = false;
+    while (sent < kMostAttempted && !heldBack) {
+        auto frame = test::frameBytes(relay::FrameKind::Request, sent, dictionaryWith("Seq", sent));
+        const ssize_t count = ::send(flooder.get(), frame.data(), frame.size(), MSG_NOSIGNAL);
+        if (count < 0 && errno == EAGAIN) {
+            pollfd writable{flooder.get(), POLLOUT, 0};
+            heldBack = ::poll(&writable, 1, 1000) == 0;
+            continue;
+        }
+        ASSERT_EQ(count, static_cast<ssize_t>(frame.size())) << strerror(errno);
+        ++sent;
+    }
+    EXPECT_TRUE(heldBack) << "the server took all " << sent << " requests while stalled";
+
+    release.set_value();
+    ::fcntl(flooder.get(), F_SETFL, 0);
+    std::vector<relay::Frame> replies = test::readFrames(flooder.get(), sent);
+    ASSERT_EQ(replies.size(), sent);
+    for (uint64_t seq = 0; seq < sent; ++seq) ASSERT_EQ(replies[seq].messageId, seq);
+}
+
+TEST(RelayTest, APeerThatLeavesItsRepliesUnreadIsDroppedAtTheOutputBound) {
+    RelayLimits limits;
+    limits.outputHighWater = 256 << 10;
+    limits.maxBufferedOutput = 1 << 20;
+    RelayTestServer server(
+        [](const RelayEvent& event, RelayReply& reply) {
+            if (event.message().find("Big"))
+                reply.body().set("Blob", Value(Value::Data(256 << 10, 0xAB)));
+            return true;
+        },
+        limits);
+    UniqueFd hoarder = server.connectRaw();
+    std::vector<uint8_t> requests;
+    for (uint64_t id = 0; id < 32; ++id) {
+        auto frame = test::frameBytes(relay::FrameKind::Request, id, dictionaryWith("Big", true));
+        requests.insert(requests.end(), frame.begin(), frame.end());
+    }
+    ASSERT_TRUE(test::writeAll(hoarder.get(), requests));
+    EXPECT_TRUE(server.waitFor([&] { return server.logged("leaves its replies unread"); }));
+    EXPECT_TRUE(server.waitFor([&] { return server.invalidated() == 1; }));
+
+    auto other = connectTo(server);
+    BerthError error;
+    EXPECT_TRUE(other->request(Value::dictionary(), 20s, &error)) << error.message;
+}
+
+TEST(RelayTest, TwoHundredPeersAreServedAtOnce) {
+    constexpr size_t kPeers = 200;
+    std::mutex mutex;
+    std::condition_variable allArrived;
+    size_t arrived = 0;
+    // Every handler waits until all peers' requests are in handlers at the
+    // same time: only a server that runs them side by side gets there.
+    RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
+        std::unique_lock lock(mutex);
+        if (++arrived == kPeers) allArrived.notify_all();
+        const bool together = allArrived.wait_for(lock, 60s, [&] { return arrived >= kPeers; });
+        reply.body().set("Together", together);
+        reply.body().set("Seq", numberAt(event.message(), "Seq"));
+        return true;
+    });
+
+    std::vector<std::thread> peers;
+    std::atomic<size_t> together{0};
+    for (uint64_t seq = 0; seq < kPeers; ++seq) {
+        peers.emplace_back([&, seq] {
+            BerthError error;
+            auto connection = BerthConnection::connect(server.path(), &error);
+            if (!connection) return;
+            auto reply = connection->request(dictionaryWith("Seq", seq), 90s, &error);
+            if (reply && numberAt(*reply, "Seq") == seq && *reply->find("Together")->boolValue())
+                ++together;
+        });
+    }
+    for (auto& peer : peers) peer.join();
+    EXPECT_EQ(together.load(), kPeers);
+}
+
+TEST(RelayTest, ManyIdlePeersCostNoThreadEach) {
+    RelayTestServer server(echoWithArrivalOrder());
+    auto warmUp = connectTo(server);
+    ASSERT_TRUE(warmUp->request(Value::dictionary(), 20s));
+    const size_t before = threadCount();
+
+    std::vector<UniqueFd> peers;
+    for (int i = 0; i < 200; ++i) peers.push_back(server.connectRaw());
+    ASSERT_TRUE(server.waitFor([&] { return server.listener().connectionCount() == 201; }));
+    // Handing 200 connections over may wake a few pool workers, never one
+    // thread per peer.
+    EXPECT_LT(threadCount(), before + 50);
+    EXPECT_TRUE(warmUp->request(Value::dictionary(), 20s));
 }
 
 }  // namespace
