@@ -240,20 +240,6 @@ TEST(RunLoopTest, DestroyedLoopDropsItsWaitingWorkUnrun) {
     EXPECT_FALSE(ran);
 }
 
-TEST(RunLoopTest, MainRunLoopServesTheMainQueueOnTheMainThread) {
-    RunLoop& main = RunLoop::main();
-    EXPECT_EQ(&main, &RunLoop::main());
-    EXPECT_EQ(main.queue()->label(), "berth.main");
-    const WorkQueue* current = nullptr;
-    main.queue()->async([&] {
-        current = WorkQueue::current();
-        main.stop();
-    });
-    Watchdog watchdog(main);
-    main.run();
-    EXPECT_EQ(current, main.queue().get());
-}
-
 TEST_F(RunLoopDeathTest, WaitsThatCouldNeverEndEndTheProcess) {
     RunLoop loop;
     // The loop's thread waiting on its own queue, even before it runs.

@@ -19,6 +19,7 @@
 #include <mutex>
 #include <stdexcept>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 namespace berth {
@@ -298,23 +299,14 @@ TEST(WorkQueueTest, TargetQueueSerialisesTheQueuesOnItAndTheirSuspension) {
 TEST(WorkQueueTest, CurrentQueueIsKnownInsideItsWorkAndItsTargets) {
     auto target = WorkQueue::makeSerial("test.outer");
     auto inner = WorkQueue::makeSerial("test.inner");
-    inner->setTarget(target);
-    EXPECT_EQ(WorkQueue::current(), nullptr);
-
-    bool innerCurrent = false, targetCurrent = false, otherCurrent = true;
-    const WorkQueue* current = nullptr;
     auto other = WorkQueue::makeSerial("test.other");
-    inner->sync([&] {
-        current = WorkQueue::current();
-        innerCurrent = inner->isCurrent();
-        targetCurrent = target->isCurrent();
-        otherCurrent = other->isCurrent();
+    inner->setTarget(target);
+    const auto seen = inner->sync([&] {
+        return std::tuple(WorkQueue::current(), inner->isCurrent(), target->isCurrent(),
+                          other->isCurrent());
     });
-    EXPECT_EQ(current, inner.get());
-    EXPECT_EQ(current->label(), "test.inner");
-    EXPECT_TRUE(innerCurrent);
-    EXPECT_TRUE(targetCurrent);
-    EXPECT_FALSE(otherCurrent);
+    EXPECT_EQ(seen, std::tuple(static_cast<const WorkQueue*>(inner.get()), true, true, false));
+    EXPECT_EQ(WorkQueue::current(), nullptr);
     EXPECT_FALSE(inner->isCurrent());
 }
 
