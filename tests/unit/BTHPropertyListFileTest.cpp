@@ -76,7 +76,9 @@ TEST(BTHPropertyListFileTest, FailedWritesKeepTheOldFileAndRemoveTheirTemporary)
     withNull.set("n", nullptr);
     error.reset();
     EXPECT_FALSE(BTH_writeToURL(withNull, dir / "new.plist", kBTHStateFileWriteOptions, &error));
-    EXPECT_TRUE(isGeneralCorrupt(error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), kBTHGeneralErrorDomain);
+    EXPECT_EQ(error->code(), kBTHPropertyListWriteInvalidError);
     EXPECT_FALSE(stdfs::exists(dir / "new.plist"));
 }
 
