@@ -139,8 +139,10 @@ void RelayConnection::ready(uint32_t events) {
 }
 
 void RelayConnection::readLocked(Released& released) {
-    std::vector<uint8_t> chunk(options_.limits.readChunk);
-    const ssize_t count = ::read(socket_.get(), chunk.data(), chunk.size());
+    // Reads happen on the poller's thread only; one buffer serves them all.
+    thread_local std::vector<uint8_t> chunk;
+    if (chunk.size() < options_.limits.readChunk) chunk.resize(options_.limits.readChunk);
+    const ssize_t count = ::read(socket_.get(), chunk.data(), options_.limits.readChunk);
     if (count == 0) {
         closeLocked(kLogDebug, "the peer closed the connection", released);
     } else if (count < 0) {
