@@ -43,7 +43,8 @@ class RelayTestServer {
 
     explicit RelayTestServer(Handler handler, RelayLimits limits = {},
                              std::shared_ptr<CodeSigningService> signing = nullptr)
-        : handler_(std::move(handler)) {
+        : state_(std::make_shared<State>()) {
+        state_->handler = std::move(handler);
         int error = 0;
         std::string why;
         auto checkIn =
@@ -57,9 +58,9 @@ class RelayTestServer {
         options.label = "relay.test";
         options.limits = limits;
         options.codeSigning = signing ? signing : std::make_shared<UnsignedPeers>();
-        options.log = [this](int level, const std::string& line) {
-            std::lock_guard lock(mutex_);
-            log_.push_back(std::to_string(level) + " " + line);
+        options.log = [state = state_](int level, const std::string& line) {
+            std::lock_guard lock(state->mutex);
+            state->log.push_back(std::to_string(level) + " " + line);
         };
         listener_ = RelayListener::make(checkIn->takeSocket(),
                                         WorkQueue::makeConcurrent("relay.test.listener"),
@@ -69,15 +70,21 @@ class RelayTestServer {
             ADD_FAILURE() << why;
             return;
         }
-        listener_->setEventHandler([this](const std::shared_ptr<RelayConnection>& connection) {
-            connection->setEventHandler(
-                [this, connection](const RelayEvent& event) { onEvent(connection, event); });
-            connection->resume();
-        });
+        // The connections' last events may come after the server is gone:
+        // they hold on to the state, not to the server.
+        listener_->setEventHandler(
+            [state = state_](const std::shared_ptr<RelayConnection>& connection) {
+                connection->setEventHandler([state, connection](const RelayEvent& event) {
+                    onEvent(*state, connection, event);
+                });
+                connection->resume();
+            });
         listener_->resume();
     }
 
     ~RelayTestServer() { listener_.reset(); }
+    RelayTestServer(const RelayTestServer&) = delete;
+    RelayTestServer& operator=(const RelayTestServer&) = delete;
 
     const std::filesystem::path& path() const { return path_; }
     RelayListener& listener() { return *listener_; }
@@ -103,24 +110,24 @@ class RelayTestServer {
         const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
         while (!predicate()) {
             if (std::chrono::steady_clock::now() > limit) return false;
-            std::unique_lock lock(mutex_);
-            changed_.wait_for(lock, std::chrono::milliseconds(10));
+            std::unique_lock lock(state_->mutex);
+            state_->changed.wait_for(lock, std::chrono::milliseconds(10));
         }
         return true;
     }
 
     size_t invalidated() {
-        std::lock_guard lock(mutex_);
-        return invalidated_;
+        std::lock_guard lock(state_->mutex);
+        return state_->invalidated;
     }
     // The replies whose send() failed (the peer was gone).
     size_t unsent() {
-        std::lock_guard lock(mutex_);
-        return unsent_;
+        std::lock_guard lock(state_->mutex);
+        return state_->unsent;
     }
     std::vector<std::string> log() {
-        std::lock_guard lock(mutex_);
-        return log_;
+        std::lock_guard lock(state_->mutex);
+        return state_->log;
     }
     bool logged(const std::string& text) {
         for (const auto& line : log())
@@ -128,16 +135,22 @@ class RelayTestServer {
         return false;
     }
 
-    // Lets the test wait on its own conditions under the server's lock.
-    std::mutex& mutex() { return mutex_; }
-    void notify() { changed_.notify_all(); }
-
   private:
-    void onEvent(const std::shared_ptr<RelayConnection>& connection, const RelayEvent& event) {
+    struct State {
+        Handler handler;
+        std::mutex mutex;
+        std::condition_variable changed;
+        size_t invalidated = 0;
+        size_t unsent = 0;
+        std::vector<std::string> log;
+    };
+
+    static void onEvent(State& state, const std::shared_ptr<RelayConnection>& connection,
+                        const RelayEvent& event) {
         if (event.isConnectionInvalid()) {
-            std::lock_guard lock(mutex_);
-            ++invalidated_;
-            changed_.notify_all();
+            std::lock_guard lock(state.mutex);
+            ++state.invalidated;
+            state.changed.notify_all();
             return;
         }
         std::optional<RelayReply> reply = event.makeReply();
@@ -145,24 +158,18 @@ class RelayTestServer {
             connection->cancel();
             return;
         }
-        if (handler_(event, *reply) && !reply->send()) {
-            std::lock_guard lock(mutex_);
-            ++unsent_;
-            changed_.notify_all();
+        if (state.handler(event, *reply) && !reply->send()) {
+            std::lock_guard lock(state.mutex);
+            ++state.unsent;
+            state.changed.notify_all();
         }
     }
 
-    Handler handler_;
+    std::shared_ptr<State> state_;
     ScratchDir directory_;
     std::filesystem::path path_;
     std::optional<ServiceCheckIn> checkIn_;
     std::unique_ptr<RelayListener> listener_;
-
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    size_t invalidated_ = 0;
-    size_t unsent_ = 0;
-    std::vector<std::string> log_;
 };
 
 // Encodes one frame.
