@@ -60,7 +60,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const fs::path& container = scratch().container();
     {
         std::ofstream out(berth::BTHMetadata::metadataFileURL(container),
-                          std::ios::binary | std::ios::trunc);
+                          std::ofstream::binary | std::ofstream::trunc);
         out.write(reinterpret_cast<const char*>(data), static_cast<std::streamsize>(size));
         if (!out) std::abort();
     }

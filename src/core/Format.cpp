@@ -62,29 +62,30 @@ std::string FormatArg::asText() const {
 
 namespace {
 
-struct Spec {
+struct Conversion {
     std::string flags;
     std::string width;
     std::string precision;  // including the dot, if any
     std::string length;
-    char conversion = 0;
+    char letter = 0;
 };
 
 // Parses one conversion starting after '%'; returns the index after it, or
 // npos if the format ends inside the conversion.
-size_t parseSpec(std::string_view f, size_t i, Spec& spec) {
+size_t parseConversion(std::string_view f, size_t i, Conversion& conversion) {
     while (i < f.size() && std::string_view("-+ #0'").find(f[i]) != std::string_view::npos)
-        spec.flags.push_back(f[i++]);
-    while (i < f.size() && isdigit(static_cast<unsigned char>(f[i]))) spec.width.push_back(f[i++]);
+        conversion.flags.push_back(f[i++]);
+    while (i < f.size() && isdigit(static_cast<unsigned char>(f[i])))
+        conversion.width.push_back(f[i++]);
     if (i < f.size() && f[i] == '.') {
-        spec.precision.push_back(f[i++]);
+        conversion.precision.push_back(f[i++]);
         while (i < f.size() && isdigit(static_cast<unsigned char>(f[i])))
-            spec.precision.push_back(f[i++]);
+            conversion.precision.push_back(f[i++]);
     }
     while (i < f.size() && std::string_view("hlqjzt").find(f[i]) != std::string_view::npos)
-        spec.length.push_back(f[i++]);
+        conversion.length.push_back(f[i++]);
     if (i >= f.size()) return std::string_view::npos;
-    spec.conversion = f[i];
+    conversion.letter = f[i];
     return i + 1;
 }
 
@@ -97,10 +98,10 @@ int integerBits(const std::string& length) {
     return 64;
 }
 
-std::string formatInteger(const Spec& spec, const FormatArg& arg) {
-    const int bits = integerBits(spec.length);
-    const bool isSigned = spec.conversion == 'd' || spec.conversion == 'i';
-    const std::string base = "%" + spec.flags + spec.width + spec.precision;
+std::string formatInteger(const Conversion& conversion, const FormatArg& arg) {
+    const int bits = integerBits(conversion.length);
+    const bool isSigned = conversion.letter == 'd' || conversion.letter == 'i';
+    const std::string base = "%" + conversion.flags + conversion.width + conversion.precision;
     char buffer[128];
     if (isSigned) {
         int64_t v = arg.asSigned();
@@ -111,34 +112,37 @@ std::string formatInteger(const Spec& spec, const FormatArg& arg) {
     } else {
         uint64_t v = arg.asUnsigned();
         if (bits < 64) v &= (uint64_t{1} << bits) - 1;
-        snprintf(buffer, sizeof buffer, (base + "ll" + spec.conversion).c_str(),
+        snprintf(buffer, sizeof buffer, (base + "ll" + conversion.letter).c_str(),
                  static_cast<unsigned long long>(v));
     }
     return buffer;
 }
 
-std::string formatText(const Spec& spec, const std::string& text) {
-    if (spec.width.empty() && spec.precision.empty()) return text;
-    int size = snprintf(nullptr, 0, ("%" + spec.flags + spec.width + spec.precision + "s").c_str(),
-                        text.c_str());
+std::string formatText(const Conversion& conversion, const std::string& text) {
+    if (conversion.width.empty() && conversion.precision.empty()) return text;
+    int size =
+        snprintf(nullptr, 0,
+                 ("%" + conversion.flags + conversion.width + conversion.precision + "s").c_str(),
+                 text.c_str());
     std::string out(static_cast<size_t>(size) + 1, '\0');
-    snprintf(out.data(), out.size(), ("%" + spec.flags + spec.width + spec.precision + "s").c_str(),
+    snprintf(out.data(), out.size(),
+             ("%" + conversion.flags + conversion.width + conversion.precision + "s").c_str(),
              text.c_str());
     out.resize(static_cast<size_t>(size));
     return out;
 }
 
-std::string formatOne(const Spec& spec, const FormatArg& arg) {
+std::string formatOne(const Conversion& conversion, const FormatArg& arg) {
     char buffer[512];
-    switch (spec.conversion) {
+    switch (conversion.letter) {
         case 'd':
         case 'i':
         case 'u':
         case 'x':
         case 'X':
         case 'o':
-            if (arg.kind() == FormatArg::Kind::Text) return formatText(spec, arg.asText());
-            return formatInteger(spec, arg);
+            if (arg.kind() == FormatArg::Kind::Text) return formatText(conversion, arg.asText());
+            return formatInteger(conversion, arg);
         case 'c':
             return std::string(1, static_cast<char>(arg.asSigned()));
         case 'f':
@@ -148,7 +152,9 @@ std::string formatOne(const Spec& spec, const FormatArg& arg) {
         case 'e':
         case 'E':
             snprintf(buffer, sizeof buffer,
-                     ("%" + spec.flags + spec.width + spec.precision + spec.conversion).c_str(),
+                     ("%" + conversion.flags + conversion.width + conversion.precision +
+                      conversion.letter)
+                         .c_str(),
                      arg.asDouble());
             return buffer;
         case 'p':
@@ -158,7 +164,7 @@ std::string formatOne(const Spec& spec, const FormatArg& arg) {
         case 's':
         case '@':
         default:
-            return formatText(spec, arg.asText());
+            return formatText(conversion, arg.asText());
     }
 }
 
@@ -180,13 +186,13 @@ std::string formatv(std::string_view format, std::span<const FormatArg> args) {
             i += 2;
             continue;
         }
-        Spec spec;
-        size_t end = parseSpec(format, i + 1, spec);
+        Conversion conversion;
+        size_t end = parseConversion(format, i + 1, conversion);
         if (end == std::string_view::npos) {
             out.append(format.substr(i));
             break;
         }
-        if (next < args.size()) out += formatOne(spec, args[next]);
+        if (next < args.size()) out += formatOne(conversion, args[next]);
         ++next;
         i = end;
     }

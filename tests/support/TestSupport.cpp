@@ -106,13 +106,13 @@ size_t LogCapture::count(int level, const std::string& text) const {
 }
 
 void writeFile(const std::filesystem::path& path, const std::string& text) {
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    std::ofstream out(path, std::ofstream::binary | std::ofstream::trunc);
     out << text;
     if (!out) throw std::runtime_error("cannot write " + path.string());
 }
 
 std::string readFile(const std::filesystem::path& path) {
-    std::ifstream in(path, std::ios::binary);
+    std::ifstream in(path, std::ifstream::binary);
     std::ostringstream s;
     s << in.rdbuf();
     return s.str();

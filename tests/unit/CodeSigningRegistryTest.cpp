@@ -213,7 +213,7 @@ TEST_F(CodeSigningRegistryTest, NoIdentityWithoutAMatchingSignature) {
 
     // Changed after signing: the digest no longer matches.
     {
-        std::ofstream(sleeper_, std::ios::app) << '\n';
+        std::ofstream(sleeper_, std::ofstream::app) << '\n';
         Child child = startSleeper();
         EXPECT_FALSE(registry_.identify(child.pid(), child.pidfd(), &why));
         EXPECT_NE(why.find("do not match"), std::string::npos) << why;
