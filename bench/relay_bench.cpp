@@ -11,10 +11,17 @@
 // Printed per server and client count: requests/s, p50 and p99 round trip,
 // and requests/s as a ratio to the echo server's.
 //
-//   relay_bench [seconds per measurement, default 2]
+//   daemon          a real berthd on a scratch device root (when its path is
+//                   given), with this program signed as a client holding
+//                   ".allowed": every request goes through the daemon's
+//                   intake (identity, entitlement check, command dispatch)
+//
+//   relay_bench [seconds per measurement, default 2] [path of berthd]
+#include <signal.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -31,6 +38,8 @@
 #include <vector>
 
 #include "core/RelayCodec.h"
+#include "platform/CodeSigningRegistry.h"
+#include "platform/NamedSemaphore.h"
 #include "platform/RelayListener.h"
 #include "platform/ServiceCheckIn.h"
 
@@ -200,6 +209,51 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
     return result;
 }
 
+// A berthd serving `root`, with this program signed into the root's
+// registry; stopped when the object goes.
+class Daemon {
+  public:
+    Daemon(const std::filesystem::path& binary, const std::filesystem::path& root) {
+        std::filesystem::create_directories(root / "etc");
+        std::filesystem::create_directories(root / "private/var/mobile");
+        std::filesystem::create_directories(root / "private/var/root");
+        FILE* passwd = std::fopen((root / "etc/passwd").c_str(), "w");
+        std::fputs(
+            "root:x:0:0::/private/var/root:/bin/sh\n"
+            "mobile:x:501:501::/private/var/mobile:/bin/sh\n",
+            passwd);
+        std::fclose(passwd);
+        Value entitlements = Value::dictionary();
+        entitlements.set("sys.kelp.private.Berth.allowed", true);
+        std::string why;
+        CodeSigningRegistry registry;
+        if (registry.sign(std::filesystem::read_symlink("/proc/self/exe"), "sys.kelp.bench.client",
+                          entitlements, &why) != 0) {
+            std::fprintf(stderr, "sign: %s\n", why.c_str());
+            std::exit(1);
+        }
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            ::execl(binary.c_str(), binary.c_str(), nullptr);
+            _exit(127);
+        }
+        socket_ = root / "run/berthd/sys.kelp.berthd";
+        for (int i = 0; i < 500 && !std::filesystem::exists(socket_); ++i)
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    }
+    ~Daemon() {
+        ::kill(pid_, SIGKILL);
+        ::waitpid(pid_, nullptr, 0);
+        NamedSemaphore::remove("berthd.fb_check");  // the scratch root's marker
+    }
+    const std::filesystem::path& socket() const { return socket_; }
+
+  private:
+    pid_t pid_ = -1;
+    std::filesystem::path socket_;
+};
+
 UniqueFd claim(const std::filesystem::path& dir, const std::string& name) {
     std::string why;
     auto endpoint = ServiceCheckIn::claim(name, SOCK_STREAM, 0666, nullptr, &why, dir);
@@ -220,6 +274,13 @@ int main(int argc, char** argv) {
     char templ[] = "/tmp/relay-bench.XXXXXX";
     if (!::mkdtemp(templ)) return 1;
     const std::filesystem::path dir = templ;
+    // The daemon's device root; this program reads it too (the registry).
+    const std::filesystem::path root = dir / "root";
+    std::unique_ptr<Daemon> daemon;
+    if (argc > 2) {
+        ::setenv("BERTH_ROOT", root.c_str(), 1);
+        daemon = std::make_unique<Daemon>(argv[2], root);
+    }
 
     EchoServer echo(claim(dir, "echo"));
     auto relay = startRelay(claim(dir, "relay"), false);
@@ -229,11 +290,12 @@ int main(int argc, char** argv) {
                 "p99 us", "vs echo");
     for (int clients : {1, 8, 64}) {
         const Result baseline = measure(dir / "echo", clients, seconds);
-        const std::pair<const char*, Result> rows[] = {
+        std::vector<std::pair<const char*, Result>> rows = {
             {"echo", baseline},
             {"relay", measure(dir / "relay", clients, seconds)},
             {"relay+identity", measure(dir / "relay-identity", clients, seconds)},
         };
+        if (daemon) rows.emplace_back("daemon", measure(daemon->socket(), clients, seconds));
         for (const auto& [name, result] : rows)
             std::printf("%-15s %7d %12.0f %10.1f %10.1f %9.2f\n", name, clients,
                         result.requestsPerSecond, result.p50Microseconds, result.p99Microseconds,
@@ -241,6 +303,7 @@ int main(int argc, char** argv) {
                             ? result.requestsPerSecond / baseline.requestsPerSecond
                             : 0.0);
     }
+    daemon.reset();
     relay.reset();
     relayIdentity.reset();
     std::error_code ignored;
