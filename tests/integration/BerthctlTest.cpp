@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <fstream>
 #include <optional>
 #include <string>
 #include <vector>
@@ -157,6 +158,55 @@ TEST_F(BerthctlTest, EntitlementsFollowTheSignatureOfTheRunningProgram) {
     ASSERT_EQ(removed.status, 0) << removed.err;
     EXPECT_FALSE(CodeSigningRegistry().entryFor(std::filesystem::canonical(kBerthctl)));
     EXPECT_EQ(printedReplyError(berthctl({"send", R"({"Command": 1})"})), 55u);
+}
+
+// The entitlement rules through the real daemon: clients registered under
+// different identities, each a copy of berthctl signed with its own set.
+TEST_F(BerthctlTest, EntitlementMatrixThroughTheDaemon) {
+    ASSERT_NO_FATAL_FAILURE(startDaemon());
+    test::ScratchDir dir;
+    ::chmod(dir.path().c_str(), 0755);
+    Value wipeList = Value::array();
+    wipeList.push("sys.kelp.plugin");
+    struct Client {
+        const char* name;
+        std::vector<std::pair<const char*, Value>> entitlements;
+        // Expected reply errors of commands 0, 1, 11 and 24: 49 when the
+        // request reached its (not yet built) handler, 55 when refused.
+        uint64_t expected[4];
+    };
+    const Client clients[] = {
+        {"none", {}, {49, 55, 55, 55}},
+        {"allowed", {{"sys.kelp.private.Berth.allowed", true}}, {49, 49, 49, 49}},
+        {"lookup", {{"sys.kelp.private.Berth.otherIdLookup", true}}, {49, 55, 55, 55}},
+        {"wiper", {{"sys.kelp.private.Berth.wipeContainer", wipeList}}, {49, 55, 49, 55}},
+        {"wipeflag", {{"sys.kelp.private.Berth.wipeContainer", true}}, {49, 55, 55, 55}},
+        {"migrator", {{"sys.kelp.private.Berth.dataMigration", true}}, {49, 55, 55, 49}},
+    };
+    const uint64_t commands[] = {0, 1, 11, 24};
+    for (const Client& client : clients) {
+        const auto program = dir / client.name;
+        std::filesystem::copy_file(kBerthctl, program);
+        Value entitlements = Value::dictionary();
+        for (const auto& [key, value] : client.entitlements) entitlements.set(key, value);
+        std::string why;
+        ASSERT_EQ(CodeSigningRegistry().sign(program, std::string("sys.kelp.") + client.name,
+                                             entitlements, &why),
+                  0)
+            << why;
+        for (size_t i = 0; i < 4; ++i) {
+            const std::string request = "{\"Command\": " + std::to_string(commands[i]) + "}";
+            EXPECT_EQ(printedReplyError(run(program, {"send", request})), client.expected[i])
+                << client.name << " command " << commands[i];
+        }
+    }
+
+    // A signed program changed after signing no longer matches its digest:
+    // it has no identity, so only the open commands answer.
+    const auto changed = dir / "allowed";
+    { std::ofstream(changed, std::ofstream::app) << "tampered"; }
+    EXPECT_EQ(printedReplyError(run(changed, {"send", R"({"Command": 1})"})), 55u);
+    EXPECT_EQ(printedReplyError(run(changed, {"send", R"({"Command": 0})"})), 49u);
 }
 
 TEST_F(BerthctlTest, DaemonThatCannotBeAskedIsExitStatusTwo) {
