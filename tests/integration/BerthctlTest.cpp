@@ -21,6 +21,7 @@
 #include "core/ValueJson.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/LockStateNotification.h"
+#include "platform/NamedSemaphore.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -96,6 +97,9 @@ class BerthctlTest : public ::testing::Test {
         BERTH_REQUIRE_ROOT();
         ASSERT_TRUE(kRootInstalled);
     }
+
+    // The scratch root's first-boot marker outlives the test otherwise.
+    void TearDown() override { NamedSemaphore::remove("berthd.fb_check"); }
 
     // Starts the daemon on the scratch root and waits until it serves.
     void startDaemon() {
