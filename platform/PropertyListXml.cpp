@@ -5,6 +5,7 @@
 #include <charconv>
 #include <cstring>
 
+#include "core/Base64.h"
 #include "platform/PropertyListInternal.h"
 
 namespace berth::plist {
@@ -114,15 +115,6 @@ bool parseDate(std::string_view text, Value* out) {
         days * 86400 + static_cast<int64_t>(hour * 3600 + minute * 60 + second));
     *out = Value(Value::Date{seconds + fraction});
     return true;
-}
-
-int base64Digit(char c) {
-    if (c >= 'A' && c <= 'Z') return c - 'A';
-    if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-    if (c >= '0' && c <= '9') return c - '0' + 52;
-    if (c == '+') return 62;
-    if (c == '/') return 63;
-    return -1;
 }
 
 // Standard base64; whitespace anywhere is ignored, padding is optional.

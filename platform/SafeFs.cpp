@@ -151,8 +151,10 @@ int lstatNoFollow(const std::filesystem::path& path, struct stat* st) {
     return ::fstatat(parent.get(), name.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
-UniqueFd openDirectoryChecked(int dirFd, const char* name, const struct stat& expected) {
-    UniqueFd fd = openAtNoFollow(dirFd, name, O_RDONLY | O_DIRECTORY | O_NONBLOCK);
+namespace {
+
+// `fd` if it is the item `expected` describes; else invalid, errno ESTALE.
+UniqueFd ifSameItem(UniqueFd fd, const struct stat& expected) {
     if (!fd) return {};
     struct stat st;
     if (::fstat(fd.get(), &st) != 0) return {};
@@ -163,21 +165,19 @@ UniqueFd openDirectoryChecked(int dirFd, const char* name, const struct stat& ex
     return fd;
 }
 
+}  // namespace
+
+UniqueFd openDirectoryChecked(int dirFd, const char* name, const struct stat& expected) {
+    return ifSameItem(openAtNoFollow(dirFd, name, O_RDONLY | O_DIRECTORY | O_NONBLOCK), expected);
+}
+
 UniqueFd openItemChecked(int dirFd, const char* name, const struct stat& expected) {
     // Only files and directories: opening a device node could act on a device.
     if (!S_ISREG(expected.st_mode) && !S_ISDIR(expected.st_mode)) {
         errno = EINVAL;
         return {};
     }
-    UniqueFd fd = openAtNoFollow(dirFd, name, O_RDONLY | O_NONBLOCK | O_NOCTTY);
-    if (!fd) return {};
-    struct stat st;
-    if (::fstat(fd.get(), &st) != 0) return {};
-    if (!sameItem(st, expected)) {
-        errno = ESTALE;
-        return {};
-    }
-    return fd;
+    return ifSameItem(openAtNoFollow(dirFd, name, O_RDONLY | O_NONBLOCK | O_NOCTTY), expected);
 }
 
 int makePath(const std::filesystem::path& path, mode_t mode) {
