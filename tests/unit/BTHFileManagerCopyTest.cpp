@@ -285,9 +285,10 @@ TEST(BTHFileManagerCopy, ASubdirectorySwappedForALinkMidCopyIsCopiedAsALink) {
                 ++linksCopied;
                 continue;
             }
-            if (e.is_regular_file())
+            if (e.is_regular_file()) {
                 ASSERT_EQ(test::readFile(e.path()), "mine")
                     << "round " << round << ": " << e.path() << " came from outside";
+            }
         }
         std::error_code ec;
         stdfs::remove_all(dest, ec);

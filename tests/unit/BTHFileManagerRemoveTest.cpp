@@ -119,8 +119,11 @@ TEST(BTHFileManagerRemove, ImmutableFilesAreUnflaggedAndRemoved) {
         const std::string line = "Unset UF_IMMUTABLE on " + (tree / f).string();
         EXPECT_EQ(log.count(BTHLogLevelNotice, line), 1u) << line;
     }
-    for (const auto& line : log.lines())
-        if (line.level == BTHLogLevelNotice) EXPECT_EQ(line.function, kRemoveName);
+    for (const auto& line : log.lines()) {
+        if (line.level == BTHLogLevelNotice) {
+            EXPECT_EQ(line.function, kRemoveName);
+        }
+    }
 
     // An immutable file given directly goes the same way.
     test::writeFile(dir / "alone", "x");

@@ -141,7 +141,7 @@ TEST(BTHFileManagerWalk, EndsOnTheCallbacksAnswerWithItsError) {
 
 TEST(BTHFileManagerWalk, AMissingRootFailsWithoutACallback) {
     ScratchDir dir;
-    for (const stdfs::path root : {dir / "missing", dir / "missing/below"}) {
+    for (const stdfs::path& root : {dir / "missing", dir / "missing/below"}) {
         bool ok = true;
         BTHErrorRef error;
         EXPECT_TRUE(walkAll(root, &ok, &error).empty());
