@@ -118,6 +118,31 @@ class BTHFileManager {
     bool itemExistsAtURL(const std::filesystem::path& url);
     bool itemDoesNotExistAtURL(const std::filesystem::path& url);
 
+    // Access control lists and ownership (BTHFileManager+ACL.cpp). System
+    // containers are shared by system processes of different users through
+    // the group "systemusers": their items get mode 0, owner -2:-2 (on Linux
+    // the user and group "nobody", 65534) and ACL entries granting the group
+    // everything; the top directory only lets the group create entries. The
+    // metadata file is never touched. Trees are walked without following
+    // links, each item is changed through the descriptor that was checked,
+    // and a non-directory with more than one hard link is left alone
+    // (logged), so a planted link cannot hand an outside file over. Building
+    // an ACL fails with 63 (BTHErrorACLFailed); applying one never stops a
+    // walk (each failure is logged).
+    bool setTopLevelSystemContainerACLAtURL(const std::filesystem::path& url, BTHErrorRef* error);
+    bool standardizeACLsAtURL(const std::filesystem::path& url, bool isSystemContainer,
+                              BTHErrorRef* error);
+    bool standardizeACLsForSystemContainerAtURL(const std::filesystem::path& url,
+                                                BTHErrorRef* error);
+    // Every system container in `directory`; a missing directory succeeds;
+    // fails with the last container's error after trying them all.
+    bool standardizeAllSystemContainerACLsAtURL(const std::filesystem::path& directory,
+                                                BTHErrorRef* error);
+    // Bundle containers: owner uid:gid, mode 0755 for directories and
+    // executables, 0644 for everything else.
+    bool standardizeOwnershipAtURL(const std::filesystem::path& url, uid_t uid, gid_t gid,
+                                   BTHErrorRef* error);
+
   private:
     BTHFileManager() = default;
     bool copyItem(const std::filesystem::path& source, const std::filesystem::path& dest,
