@@ -1,5 +1,6 @@
 #include "BTHCommandTable.h"
 
+#include "BTHContainerCommands.h"
 #include "BTHError.h"
 
 namespace berth {
@@ -23,15 +24,15 @@ constexpr BTHCommandRow row(uint64_t command, const char* name, const char* enti
 
 const std::array<BTHCommandRow, kBTHCommandCount>& BTHCommandTable() {
     static const std::array<BTHCommandRow, kBTHCommandCount> table{{
-        row(0, "createOrLookupContainer", kBTHEntitlementNone),
-        row(1, "listContainers", kBTHEntitlementAllowed),
+        row(0, "createOrLookupContainer", kBTHEntitlementNone, 1, createOrLookupContainer),
+        row(1, "listContainers", kBTHEntitlementAllowed, 1, listContainers),
         row(2, "replaceContainer", kBTHEntitlementAllowed),
         row(3, "stageContainerForDelete", kBTHEntitlementAllowed),
         row(4, "deleteContainersOnDeathRow", kBTHEntitlementAllowed, 0),
-        row(5, "setInfoValue", kBTHEntitlementAllowed),
-        row(6, "getInfoValue", kBTHEntitlementAllowed),
-        row(7, "getContainerMetadata", kBTHEntitlementAllowed),
-        row(8, "recreateDefaultStructure", kBTHEntitlementAllowed),
+        row(5, "setInfoValue", kBTHEntitlementAllowed, 1, setInfoValue),
+        row(6, "getInfoValue", kBTHEntitlementAllowed, 1, getInfoValue),
+        row(7, "getContainerMetadata", kBTHEntitlementAllowed, 1, getContainerMetadata),
+        row(8, "recreateDefaultStructure", kBTHEntitlementAllowed, 1, recreateDefaultStructure),
         row(9, "regenerateDirectoryUUID", kBTHEntitlementAllowed),
         row(10, "deleteContainer", kBTHEntitlementAllowed),
         row(11, "wipePluginDataContainer", kBTHEntitlementWipeContainer),
@@ -45,7 +46,7 @@ const std::array<BTHCommandRow, kBTHCommandCount>& BTHCommandTable() {
         row(19, "getCodeSigningInfo", kBTHEntitlementAllowed),
         row(20, "invalidateCodeSigningInfo", kBTHEntitlementAllowed),
         row(21, "setDataProtection", kBTHEntitlementAllowed, 0),
-        row(22, "recreateDefaultStructure", kBTHEntitlementAllowed),
+        row(22, "recreateDefaultStructure", kBTHEntitlementAllowed, 1, recreateDefaultStructure),
         row(23, "diskUsage", kBTHEntitlementAllowed),
         row(24, "performDataMigration", kBTHEntitlementDataMigration),
         row(25, "retryTest", kBTHEntitlementAllowed),

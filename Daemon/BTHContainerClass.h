@@ -38,6 +38,10 @@ inline constexpr uid_t kBTHCallerUserId = 1;  // "the caller's own user" in a re
 inline constexpr uid_t kBTHBundleUserId = 33;
 inline constexpr uid_t kBTHSystemUserId = 499;
 inline constexpr uid_t kBTHLegacyMobileUserId = 501;
+// The owner of the items inside system containers, which the system's
+// processes reach through the "systemusers" access control entries rather
+// than through ownership: the unprivileged "nobody" user and group.
+inline constexpr uid_t kBTHNobodyUserId = 65534;
 
 // The class name ("Data/Application"), "Undefined" for 0, "MAX" for 14 and
 // an empty view for any other invalid value.

@@ -1,6 +1,10 @@
 #include "BTHMetadata.h"
 
+#include <cerrno>
+#include <cstring>
+
 #include "BTHContainerClass.h"
+#include "BTHFaultInjection.h"
 #include "BTHPropertyListFile.h"
 
 namespace berth {
@@ -143,8 +147,12 @@ bool BTHMetadata::writeMetadataToDisk(BTHErrorRef* error) const {
         dict.set(kBTHMetadataUserManagedAssetsDirNameKey, Value(*userManagedAssetsDirName_));
 
     BTHErrorRef writeError;
-    if (BTH_writeToURL(dict, metadataFileURL(url_), kBTHStateFileWriteOptions, &writeError))
+    if (BTHFaultActive("metadata.write")) {
+        writeError = BTHMakePOSIXError(EIO, "%s", strerror(EIO));
+    } else if (BTH_writeToURL(dict, metadataFileURL(url_), kBTHStateFileWriteOptions,
+                              &writeError)) {
         return true;
+    }
     BTHSetError(error, BTHMakeError(BTHErrorWriteFailed, writeError,
                                     "Failed to write metadata dictionary to URL %@", url_));
     return false;

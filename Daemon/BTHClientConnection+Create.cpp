@@ -1,0 +1,382 @@
+// Creating and finding containers: the one way a container comes into being.
+// A container is built in the private staging directory under a fresh name,
+// given its metadata file, access control list and subdirectories there, and
+// only then moved into its live place with one rename, so look-ups never see
+// a half-built container and a crash leaves at most a staging leftover that
+// the next start sends to death row.
+#include <array>
+
+#include "BTHClientConnection.h"
+#include "BTHCodeSigningMapping.h"
+#include "BTHContainerCache.h"
+#include "BTHContainerClass.h"
+#include "BTHFaultInjection.h"
+#include "BTHFileManager.h"
+#include "BTHGlobalConfiguration.h"
+#include "BTHLocks.h"
+#include "BTHLog.h"
+#include "BTHWhitelist.h"
+#include "platform/DeviceProperties.h"
+#include "platform/SandboxMappingStore.h"
+
+namespace berth {
+
+namespace {
+
+constexpr const char* kCreateFunction =
+    "-[BTHClientConnection "
+    "createOrLookupContainerForUser:identifier:createIfNecessary:containerClass:transient:"
+    "useLocking:withError:]";
+
+// Who owns a new container's directories and what its subdirectories are.
+struct ContainerLayout {
+    uid_t topOwner;  // 0: left as created (root)
+    std::vector<const char*> subdirectories;
+    mode_t subdirectoryMode;
+    uid_t subdirectoryOwner;
+};
+
+ContainerLayout layoutFor(uint64_t containerClass, uid_t userId) {
+    static const std::vector<const char*> kDataDirectories = {
+        "Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"};
+    static const std::vector<const char*> kGroupDirectories = {"Library", "Library/Caches"};
+    // System containers: the subdirectories' owner and other bits stay empty;
+    // the group bits carry the mask of the "systemusers" entry they inherit
+    // from the top directory's access control list.
+    constexpr mode_t kSystemMode = 0070;
+    switch (containerClass) {
+        case BTHContainerClassDataSystem:
+            return {0, kDataDirectories, kSystemMode, kBTHNobodyUserId};
+        case BTHContainerClassSharedSystemGroup:
+            return {0, kGroupDirectories, kSystemMode, kBTHNobodyUserId};
+        case BTHContainerClassSharedAppGroup:
+            return {userId, kGroupDirectories, 0755, userId};
+        default:
+            if (BTHContainerClassIsBundle(containerClass)) return {kBTHBundleUserId, {}, 0, 0};
+            return {userId, kDataDirectories, 0755, userId};
+    }
+}
+
+// The sandbox's item type for a class, and the user its record is kept for.
+struct SandboxItem {
+    bool recorded;
+    uid_t user;
+    uint64_t itemType;
+};
+
+std::optional<SandboxItem> sandboxItemFor(uint64_t containerClass, uid_t userId) {
+    if (BTHContainerClassIsBundle(containerClass)) return SandboxItem{false, 0, 0};
+    switch (containerClass) {
+        case BTHContainerClassSharedAppGroup:
+            return SandboxItem{true, userId, 2};
+        case BTHContainerClassDataSystem:
+            return SandboxItem{true, 0, 4};
+        case BTHContainerClassSharedSystemGroup:
+            return SandboxItem{true, 0, 8};
+        default:
+            if (BTHContainerClassIsPerUser(containerClass)) return SandboxItem{true, userId, 1};
+            return std::nullopt;
+    }
+}
+
+bool userIsValidForClass(uid_t userId, uint64_t containerClass) {
+    if (!BTHContainerClassIsValid(containerClass)) return false;
+    if (BTHContainerClassIsGlobal(containerClass))
+        return userId == BTHContainerClassGlobalUser(containerClass);
+    return true;
+}
+
+}  // namespace
+
+bool BTHClientConnection::_createDefaultDirectory(const std::filesystem::path& url, mode_t mode,
+                                                  uid_t owner, BTHErrorRef* error) {
+    return BTHFileManager::defaultManager().createDirectoryAtURL(url, true, mode, owner, error);
+}
+
+bool BTHClientConnection::_createTopLevelContainerDirectory(const std::filesystem::path& url,
+                                                            uint64_t containerClass, uid_t owner,
+                                                            BTHErrorRef* error) {
+    const uid_t topOwner = layoutFor(containerClass, owner).topOwner;
+    return BTHFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, topOwner, 0,
+                                                                 error);
+}
+
+bool BTHClientConnection::_createSubDirectories(const std::filesystem::path& url, uid_t userId,
+                                                uint64_t containerClass, BTHErrorRef* error) {
+    BTH_FUNCTION("-[BTHClientConnection _createSubDirectories:userId:containerClass:error:]");
+    const ContainerLayout layout = layoutFor(containerClass, userId);
+    for (const char* name : layout.subdirectories) {
+        BTHErrorRef createError;
+        if (!_createDefaultDirectory(url / name, layout.subdirectoryMode, layout.subdirectoryOwner,
+                                     &createError)) {
+            BTHSetError(error, BTHMakeError(BTHErrorDirectorySetupFailed, createError,
+                                            "Failed to create sub-dir at %@%@", url, name));
+            return false;
+        }
+    }
+    return true;
+}
+
+bool BTHClientConnection::_setSandboxContainerMappingForUser(
+    uid_t userId, const std::string& identifier, uint64_t containerClass,
+    const std::optional<std::filesystem::path>& url) {
+    BTH_FUNCTION(
+        "-[BTHClientConnection _setSandboxContainerMappingForUser:identifier:containerClass:url:]");
+    const std::optional<SandboxItem> item = sandboxItemFor(containerClass, userId);
+    if (!item) {
+        BTHLogError("Unsupported class for setting sandbox container mapping: %llu",
+                    containerClass);
+        return false;
+    }
+    if (!item->recorded) return true;
+    const std::string path = url ? url->string() : std::string("(null)");
+    SandboxMappingStore& store = SandboxMappingStore::shared();
+    int result = store.setUserStateItem(item->user, item->itemType, identifier, std::nullopt);
+    if (result != 0) {
+        BTHLogError(
+            "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, "
+            "path: %s : %d",
+            item->user, item->itemType, identifier, containerClass, path, result);
+        return false;
+    }
+    if (!url) return true;
+    result = store.setUserStateItem(item->user, item->itemType, identifier, url->string());
+    if (result != 0) {
+        BTHLogError(
+            "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, "
+            "path: %s : %d",
+            item->user, item->itemType, identifier, containerClass, path, result);
+        return false;
+    }
+    return true;
+}
+
+namespace {
+
+// The steps of one create-or-look-up call that run under the lock, with the
+// staging directory they may leave behind.
+class CreateOrLookup {
+  public:
+    CreateOrLookup(BTHClientConnection& client, uid_t userId, const std::string& identifier,
+                   uint64_t containerClass, bool transient)
+        : client_(client),
+          userId_(userId),
+          identifier_(identifier),
+          containerClass_(containerClass),
+          transient_(transient) {}
+
+    // Steps 6 to 18; on failure `error` holds why.
+    BTHMetadataRef run(bool createIfNecessary, BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        bool found = false;
+        BTHMetadataRef existing = lookUp(&found, error);
+        if (existing) return existing;
+        if (found) return nullptr;  // a failure other than "not found"
+        if (!createIfNecessary) {
+            BTHSetError(error, BTHMakeUnloggedError(BTHErrorNotFound, nullptr,
+                                                    "Container with identifier: \"%@\" Not Found",
+                                                    identifier_));
+            return nullptr;
+        }
+        return create(error);
+    }
+
+    // Step 19.1: a staging directory still pending goes to death row.
+    void cleanUp(BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        if (!stagingURL_) return;
+        BTHErrorRef deathRowError;
+        if (!client_._moveItemAtURLToDeathRow(*stagingURL_, true, true, &deathRowError)) {
+            BTHSetError(error, BTHMakeError(BTHErrorRemoveStagingFailed, deathRowError,
+                                            "Failed to remove staging dir: %@", *stagingURL_));
+        }
+        stagingURL_.reset();
+    }
+
+  private:
+    // Step 6. Returns the found permanent container; sets `*failed` when the
+    // look-up failed with anything but "not found" (or a transient container
+    // could not be retired).
+    BTHMetadataRef lookUp(bool* failed, BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        BTHContainerCache& cache = BTHContainerCache::sharedInstance();
+        BTHErrorRef cacheError;
+        BTHMetadataRef found =
+            cache.containerForUser(userId_, containerClass_, identifier_, transient_, &cacheError);
+        if (!found) {
+            if (cacheError && cacheError->isBTHError(BTHErrorNotFound)) return nullptr;
+            *failed = true;
+            BTHSetError(error, cacheError);
+            return nullptr;
+        }
+        if (!transient_) {
+            // The caller gets a snapshot: the cached record may change once
+            // the lock is released.
+            auto snapshot = std::make_shared<BTHMetadata>(*found);
+            snapshot->setExisted(true);
+            return snapshot;
+        }
+        BTHErrorRef deathRowError;
+        if (!client_._moveItemAtURLToDeathRow(found->url(), true, true, &deathRowError)) {
+            *failed = true;
+            BTHSetError(error,
+                        BTHMakeError(BTHErrorRemoveTransientFailed, deathRowError,
+                                     "Failed to remove transient container at %@", found->url()));
+        }
+        return nullptr;
+    }
+
+    // Steps 8 to 18.
+    BTHMetadataRef create(BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        const Uuid directoryUuid = Uuid::random();
+        const std::string directoryName = directoryUuid.string();
+        BTHGlobalConfiguration& configuration = BTHGlobalConfiguration::sharedInstance();
+        const std::filesystem::path staging = configuration.stagingDirectory() / directoryName;
+        stagingURL_ = staging;
+
+        BTHErrorRef stepError;
+        if (!client_._createTopLevelContainerDirectory(staging, containerClass_, userId_,
+                                                       &stepError)) {
+            BTHSetError(
+                error, BTHMakeError(BTHErrorCreateStagingFailed, stepError,
+                                    "Failed to create staging dir at %@ : %@", staging, stepError));
+            return nullptr;
+        }
+        auto record =
+            std::make_shared<BTHMetadata>(userId_, Uuid::random(), containerClass_, identifier_,
+                                          std::nullopt, staging, std::nullopt);
+        if (!record->writeMetadataToDisk(error)) return nullptr;
+        if (BTHContainerClassIsSystem(containerClass_) &&
+            !BTHFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error))
+            return nullptr;
+        if (!client_._createSubDirectories(staging, userId_, containerClass_, error))
+            return nullptr;
+        BTHCrashPoint("create.staged");
+
+        const std::optional<std::filesystem::path> parent =
+            configuration.containerDirectoryURLForUser(userId_, containerClass_, transient_);
+        const std::filesystem::path live =
+            (parent ? *parent : std::filesystem::path()) / liveName(directoryName);
+        if (!parent || !BTHFileManager::defaultManager().moveItemAtURL(staging, live, &stepError)) {
+            BTHSetError(error, BTHMakeError(BTHErrorMoveStagingFailed, stepError,
+                                            "Failed to move staging dir: %@ to live dir: %@",
+                                            staging, live));
+            return nullptr;
+        }
+        stagingURL_.reset();
+        record->setUrl(live);
+        record->setExisted(false);
+        record->setTransient(transient_);
+        return addToCache(record, live, error);
+    }
+
+    // Step 14: well-known system containers live under their fixed name.
+    std::string liveName(const std::string& directoryName) const {
+        const BTHWhitelist& whitelist = BTHWhitelist::sharedWhitelist();
+        std::optional<std::string> wellKnown;
+        if (containerClass_ == BTHContainerClassDataSystem)
+            wellKnown = whitelist.wellknownSystemContainerForId(identifier_);
+        else if (containerClass_ == BTHContainerClassSharedSystemGroup)
+            wellKnown = whitelist.wellknownSystemGroupContainerForId(identifier_);
+        return wellKnown ? *wellKnown : directoryName;
+    }
+
+    // Step 17. The live directory stays even when the cache refuses it.
+    BTHMetadataRef addToCache(const BTHMetadataRef& record, const std::filesystem::path& live,
+                              BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        BTHErrorRef cacheError;
+        bool added = false;
+        if (BTHFaultActive("create.cache-add")) {
+            cacheError = BTHMakeUnloggedError(BTHErrorCacheInvalidInput, nullptr,
+                                              "Invalid input: URL: %@", live);
+        } else {
+            added = BTHContainerCache::sharedInstance().addContainerMetadata(
+                record, userId_, live, transient_, &cacheError);
+        }
+        if (!added) {
+            BTHSetError(error,
+                        BTHMakeError(BTHErrorCacheAddFailed, cacheError,
+                                     "Failed to add to cache for %u : %@, url: %@, transient: %d",
+                                     userId_, record, live, transient_));
+            return nullptr;
+        }
+        return std::make_shared<BTHMetadata>(*record);
+    }
+
+    BTHClientConnection& client_;
+    const uid_t userId_;
+    const std::string identifier_;
+    const uint64_t containerClass_;
+    const bool transient_;
+    std::optional<std::filesystem::path> stagingURL_;
+};
+
+}  // namespace
+
+BTHErrorRef BTHClientConnection::checkCreateOrLookupRequest(
+    uid_t userId, const std::optional<std::string>& identifier, uint64_t containerClass) {
+    BTH_FUNCTION(kCreateFunction);
+    if (!identifier || !BTHContainerClassIsValid(containerClass)) {
+        return BTHMakeError(BTHErrorInvalidArgument, nullptr,
+                            "Can't act on an invalid object: userId: %u, ID: %@, class: %ld",
+                            userId, identifier, containerClass);
+    }
+    if (!userIsValidForClass(userId, containerClass)) {
+        return BTHMakeError(BTHErrorInvalidArgument, nullptr,
+                            "Invalid userId %u for class %ld, ID: %@", userId, containerClass,
+                            identifier);
+    }
+    const bool ownIdentifier = clientBundleIdentifier_ == identifier;
+    const bool groupClass = containerClass == BTHContainerClassSharedAppGroup ||
+                            containerClass == BTHContainerClassSharedSystemGroup;
+    if (!ownIdentifier && !allowOtherIdLookup_ && !(groupClass && allowGroupIdLookup_) &&
+        DeviceProperties::isInternalBuild()) {
+        BTHLogWarning(
+            "%@ trying to retrieve container class %ld for identifier: %@. WARNING: Soon you will "
+            "need an entitlement to do this. File a Snag in \"Berth | all\"",
+            clientBundleIdentifier_, containerClass, identifier);
+    }
+    if (containerClass == BTHContainerClassDataSystem && !allowOtherIdLookup_) {
+        BTHCodeSigningMapping* mapping = BTHCodeSigningMapping::sharedInstance();
+        if (!ownIdentifier || !mapping || !mapping->identifierHasSystemContainer(*identifier)) {
+            return BTHMakeError(BTHErrorNotEntitled, nullptr,
+                                "%@ not entitled for system container with identifier %@",
+                                clientBundleIdentifier_, identifier);
+        }
+    }
+    return nullptr;
+}
+
+BTHMetadataRef BTHClientConnection::createOrLookupContainerForUser(
+    uid_t userId, const std::optional<std::string>& identifier, bool createIfNecessary,
+    uint64_t containerClass, bool transient, bool useLocking, uint64_t* error) {
+    BTH_FUNCTION(kCreateFunction);
+    std::optional<BTHAllIdentifiersLockGuard> lock;
+    std::optional<CreateOrLookup> operation;
+    BTHErrorRef failure;
+    BTHMetadataRef result;
+    try {
+        failure = checkCreateOrLookupRequest(userId, identifier, containerClass);
+        if (!failure) {
+            lock.emplace(true, useLocking);
+            operation.emplace(*this, userId, *identifier, containerClass, transient);
+            result = operation->run(createIfNecessary, &failure);
+        }
+    } catch (...) {
+        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
+        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
+        BTHReportCaughtException(caught);
+        result = nullptr;
+    }
+    if (operation) operation->cleanUp(&failure);
+    lock.reset();
+    if (failure || !result) {
+        BTHSetErrorCode(error, failure ? failure->code64() : uint64_t{BTHErrorNotFound});
+        return nullptr;
+    }
+    return result;
+}
+
+}  // namespace berth
