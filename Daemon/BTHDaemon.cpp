@@ -1,5 +1,7 @@
 #include "BTHDaemon.h"
 
+#include "BTHFaultInjection.h"
+
 #include <sys/socket.h>
 #include <syslog.h>
 
@@ -137,6 +139,7 @@ int BTHDaemonMain() {
     BTH_FUNCTION("main");
     RunLoop& runLoop = RunLoop::main();
     RelayTransaction::begin();  // step 1: busy until start-up is done
+    BTHFaultInjectionLoadFromEnvironment();
     openRotatingLog();
     BTHSetExceptionReporter(BTHReportUncaughtException);
 

@@ -123,9 +123,10 @@ TEST_F(DaemonStartupTest, RequestsFromAnUnsignedCallerReachOnlyOpenCommands) {
     EXPECT_EQ(replyError(request(*connection, command(30))), uint64_t{BTHErrorInvalidCommand});
     EXPECT_EQ(replyError(request(*connection, command(uint64_t{1} << 33))),
               uint64_t{BTHErrorInvalidCommand});
-    // Command 0 is open to every caller; its handler is not built in yet.
+    // Command 0 is open to every caller: its handler answers (here refusing
+    // the missing user).
     EXPECT_EQ(replyError(request(*connection, Value::dictionary())),
-              uint64_t{BTHErrorInvalidCommand});
+              uint64_t{BTHErrorInvalidParameter});
     EXPECT_NE(logText().find("missing required entitlement: sys.kelp.private.Berth.allowed"),
               std::string::npos);
 }
