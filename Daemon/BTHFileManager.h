@@ -120,16 +120,29 @@ class BTHFileManager {
 
     // Access control lists and ownership (BTHFileManager+ACL.cpp). System
     // containers are shared by system processes of different users through
-    // the group "systemusers": their items get mode 0, owner -2:-2 (on Linux
-    // the user and group "nobody", 65534) and ACL entries granting the group
-    // everything; the top directory only lets the group create entries. The
-    // metadata file is never touched. Trees are walked without following
-    // links, each item is changed through the descriptor that was checked,
-    // and a non-directory with more than one hard link is left alone
-    // (logged), so a planted link cannot hand an outside file over. Building
-    // an ACL fails with 63 (BTHErrorACLFailed); applying one never stops a
-    // walk (each failure is logged).
+    // the group "systemusers". Standardized, an item below a system
+    // container's top has the owner -2:-2 (user and group 65534), nothing for
+    // its owner and others, and ACL entries granting the group read, write
+    // and execute; a directory passes the group's entries on to everything
+    // created in it. The top keeps its mode and owner; the group may create
+    // entries in it but not list it. The metadata file is never touched.
+    //
+    // Trees are walked without following links or entering other file
+    // systems; each item is changed only through a descriptor checked to be
+    // the item the walk saw; a link gets at most its own owner; a
+    // non-directory with more than one hard link is left alone (logged), so a
+    // planted link cannot hand an outside file over. A failure on one item is
+    // logged and the walk goes on; only a failed walk fails the operation.
+    // When "systemusers" cannot be resolved, every ACL operation fails with
+    // 63 (BTHErrorACLFailed, "mbr_identifier_to_uuid() failed: %s") before
+    // changing anything.
+
+    // Gives the directory at `url` (never a link's target) the top-level
+    // list, keeping its mode and owner. Fails with 63 "Failed to set ACL on
+    // %@: %s", the cause beneath.
     bool setTopLevelSystemContainerACLAtURL(const std::filesystem::path& url, BTHErrorRef* error);
+    // The tree at `url`; its root is a system container's top when
+    // `isSystemContainer`, else treated like any directory below.
     bool standardizeACLsAtURL(const std::filesystem::path& url, bool isSystemContainer,
                               BTHErrorRef* error);
     bool standardizeACLsForSystemContainerAtURL(const std::filesystem::path& url,
@@ -139,7 +152,9 @@ class BTHFileManager {
     bool standardizeAllSystemContainerACLsAtURL(const std::filesystem::path& directory,
                                                 BTHErrorRef* error);
     // Bundle containers: owner uid:gid, mode 0755 for directories and
-    // executables, 0644 for everything else.
+    // executables, 0644 for everything else (same link rules as above), then
+    // the root once more; fails when the root cannot be looked at ("Could
+    // not stat %s: %s").
     bool standardizeOwnershipAtURL(const std::filesystem::path& url, uid_t uid, gid_t gid,
                                    BTHErrorRef* error);
 
