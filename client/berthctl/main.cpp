@@ -1,12 +1,15 @@
 // berthctl: the command-line client of berthd. Sends raw requests to the
-// daemon and does the administrator's local chores (signatures, lock state).
+// daemon, runs its container commands with typed arguments, and does the
+// administrator's local chores (signatures, lock state).
 // Each subcommand lives in its own module; this file only reads the command
 // line and hands over.
 #include <CLI/CLI.hpp>
 #include <cmath>
 #include <iostream>
+#include <vector>
 
 #include "CommandsListing.h"
+#include "ContainerCommands.h"
 #include "ExitStatus.h"
 #include "LockCommand.h"
 #include "SendCommand.h"
@@ -23,7 +26,45 @@ struct Arguments {
     SignOptions sign;
     bool signRemove = false;
     bool signList = false;
+    ContainerOptions container;
+    uint32_t user = 1;
 };
+
+std::chrono::milliseconds timeoutOf(double seconds) {
+    return std::chrono::milliseconds(std::max<long long>(1, std::llround(seconds * 1000)));
+}
+
+// The options the container subcommands share: which container, and how to
+// reach the daemon.
+void addContainerOptions(CLI::App* command, ContainerAction action, Arguments& args) {
+    ContainerOptions& container = args.container;
+    command
+        ->add_option("--class", container.containerClass,
+                     "Container class: 1-13 or a name such as Data/Application")
+        ->required();
+    command->add_option("--user", args.user, "User id; 1 (default) is your own user");
+    if (action != ContainerAction::List)
+        command->add_option_function<std::string>(
+            "--identifier", [&container](const std::string& id) { container.identifier = id; },
+            "Container identifier (default: your own)");
+    if (action != ContainerAction::List && action != ContainerAction::Create &&
+        action != ContainerAction::Lookup)
+        command->add_option("--uuid", container.uuid,
+                            "The container's UUID (default: looked up by identifier)");
+    command->add_flag("--transient", container.transient, "A transient container");
+    command->add_option("--socket", args.send.socket, "Request socket (default: the daemon's)");
+    command->add_option("--timeout", args.timeoutSeconds, "Seconds to wait for a reply")
+        ->check(CLI::PositiveNumber);
+}
+
+// Adds a container subcommand that runs `action`.
+CLI::App* addContainerCommand(CLI::App& parent, const char* name, const char* description,
+                              ContainerAction action, Arguments& args) {
+    CLI::App* command = parent.add_subcommand(name, description);
+    command->callback([&args, action] { args.container.action = action; });
+    addContainerOptions(command, action, args);
+    return command;
+}
 
 // Checks what CLI11 cannot: which positionals the chosen sign action needs.
 void validateSign(Arguments& args) {
@@ -84,6 +125,39 @@ int main(int argc, char** argv) {
     CLI::App* unlock = app.add_subcommand("unlock", "Unlock the device");
     CLI::App* commands = app.add_subcommand("commands", "List the daemon's commands");
 
+    std::vector<CLI::App*> containerCommands;
+    containerCommands.push_back(addContainerCommand(app, "create", "Create a container, or find it",
+                                                    ContainerAction::Create, args));
+    containerCommands.push_back(addContainerCommand(
+        app, "lookup", "Find a container, never creating it", ContainerAction::Lookup, args));
+    containerCommands.push_back(addContainerCommand(app, "list", "List the containers of a class",
+                                                    ContainerAction::List, args));
+    CLI::App* info = app.add_subcommand("info", "Read or change a container's info values");
+    info->require_subcommand(1);
+    CLI::App* infoGet = addContainerCommand(*info, "get", "Print the info value of a key",
+                                            ContainerAction::InfoGet, args);
+    infoGet->add_option("key", args.container.key, "The info key")->required();
+    CLI::App* infoSet = addContainerCommand(*info, "set", "Set the info value of a key",
+                                            ContainerAction::InfoSet, args);
+    infoSet->add_option("key", args.container.key, "The info key")->required();
+    infoSet->add_option("value", args.container.value, "The value as typed JSON, e.g. '\"text\"'")
+        ->required();
+    CLI::App* infoRemove = addContainerCommand(*info, "remove", "Remove the info value of a key",
+                                               ContainerAction::InfoRemove, args);
+    infoRemove->add_option("key", args.container.key, "The info key")->required();
+    containerCommands.insert(containerCommands.end(), {infoGet, infoSet, infoRemove});
+    CLI::App* metadata = addContainerCommand(app, "metadata", "Print a container's metadata",
+                                             ContainerAction::Metadata, args);
+    metadata->add_flag("--info", args.container.withInfo, "Also print its info dictionary");
+    CLI::App* recreate = addContainerCommand(app, "recreate-structure",
+                                             "Make a container's missing standard directories",
+                                             ContainerAction::RecreateStructure, args);
+    recreate
+        ->add_option("--command", args.container.recreateCommand,
+                     "Send it as command 8 (default) or its twin 22")
+        ->check(CLI::IsMember({8, 22}));
+    containerCommands.insert(containerCommands.end(), {metadata, recreate});
+
     try {
         app.parse(argc, argv);
         if (sign->parsed()) validateSign(args);
@@ -94,9 +168,16 @@ int main(int argc, char** argv) {
 
     if (send->parsed()) {
         args.send.json = args.json;
-        args.send.timeout = std::chrono::milliseconds(
-            std::max<long long>(1, std::llround(args.timeoutSeconds * 1000)));
+        args.send.timeout = timeoutOf(args.timeoutSeconds);
         return runSend(args.send, std::cin, std::cout, std::cerr);
+    }
+    for (CLI::App* command : containerCommands) {
+        if (!command->parsed()) continue;
+        args.container.json = args.json;
+        args.container.user = args.user;
+        args.container.socket = args.send.socket;
+        args.container.timeout = timeoutOf(args.timeoutSeconds);
+        return runContainerCommand(args.container, std::cout, std::cerr);
     }
     if (sign->parsed()) {
         args.sign.json = args.json;

@@ -1,0 +1,65 @@
+// The container subcommands of berthctl: "create", "lookup", "list",
+// "info get|set|remove", "metadata" and "recreate-structure", each one
+// request of the daemon (two when a container's UUID must be looked up
+// first), with typed arguments and readable output.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <filesystem>
+#include <iosfwd>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace berth::ctl {
+
+enum class ContainerAction {
+    Create,             // command 0, creating when missing
+    Lookup,             // command 0, never creating
+    List,               // command 1
+    InfoGet,            // command 6
+    InfoSet,            // command 5
+    InfoRemove,         // command 5 without a value
+    Metadata,           // command 7
+    RecreateStructure,  // command 8 or 22
+};
+
+struct ContainerOptions {
+    ContainerAction action = ContainerAction::Lookup;
+    // As given: a number 1-13 or a class name such as "Data/Application".
+    std::string containerClass;
+    // 1 is the caller's own user.
+    uint64_t user = 1;
+    // Absent: the caller's own identifier for create and lookup; for the
+    // other commands the daemon gets none.
+    std::optional<std::string> identifier;
+    // Canonical UUID text, or empty. The commands that address one existing
+    // container look it up first (command 0, never creating) when empty.
+    std::string uuid;
+    bool transient = false;
+
+    std::string key;    // info get, set and remove
+    std::string value;  // info set: typed JSON
+    bool withInfo = false;
+    uint64_t recreateCommand = 8;  // 8 or 22
+
+    // Empty: the daemon's request socket under the device root.
+    std::filesystem::path socket;
+    std::chrono::milliseconds timeout{30000};
+    bool json = false;
+};
+
+// A container class from the command line: its number (1-13) or its name,
+// in any letter case ("data/application"). Nullopt, with the reason in
+// `why`, for anything else, including the invalid classes 0 and 14.
+std::optional<uint64_t> parseContainerClass(std::string_view text, std::string* why);
+
+// Runs the action and prints its result on `out` (human-readable, or one
+// line of JSON with `json`). Returns the exit status (ExitStatus.h): a reply
+// error prints "error: <name> (<code>): <text>" on `err` and fails; bad
+// arguments are usage errors; a daemon that cannot be asked is a transport
+// error.
+int runContainerCommand(const ContainerOptions& options, std::ostream& out, std::ostream& err);
+
+}  // namespace berth::ctl
