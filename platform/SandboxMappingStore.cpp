@@ -56,6 +56,7 @@ UniqueFd openEntryDirectory(const std::filesystem::path& base, uid_t user, uint6
             return UniqueFd();
         }
         root = fs::openNoFollow(base, kDirectoryFlags);
+        if (root && made == 0) ::fchmod(root.get(), kDirectoryMode);
     }
     if (!root) return root;
     UniqueFd userDirectory = openSubdirectory(root.get(), std::to_string(user), create);
