@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <cctype>
-#include <thread>
 
 #include "BTHContainerClass.h"
 #include "BTHFileManager.h"
@@ -19,11 +18,7 @@ namespace fs = std::filesystem;
 using test::LogCapture;
 using Strings = std::vector<std::string>;
 
-const fs::path& root() {
-    static const fs::path& path = test::installScratchDeviceRoot();
-    return path;
-}
-const bool kRootInstalled = !root().empty();
+const bool kRootInstalled = !test::installScratchDeviceRoot().empty();
 
 constexpr uid_t kMobile = 501;
 constexpr uint64_t kData = BTHContainerClassDataApplication;       // "Data/Application"
@@ -34,23 +29,32 @@ BTHContainerCache& cache() {
     return BTHContainerCache::sharedInstance();
 }
 
-// The class directory, created (as the cache's build creates it).
 fs::path classDirectory(uid_t user, uint64_t containerClass, bool transient = false) {
     return *BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
         user, containerClass, transient);
 }
 
-// A container directory under a fresh UUID name holding a valid metadata
-// file, made behind the cache's back.
-BTHMetadataRef makeContainer(uid_t user, uint64_t containerClass, const std::string& identifier,
+// A container of user 501 made on disk behind the cache's back.
+BTHMetadataRef makeContainer(uint64_t containerClass, const std::string& identifier,
                              bool transient = false) {
-    const fs::path url = classDirectory(user, containerClass, transient) / Uuid::random().string();
+    const fs::path url =
+        classDirectory(kMobile, containerClass, transient) / Uuid::random().string();
     fs::create_directory(url);
-    auto record = std::make_shared<BTHMetadata>(user, Uuid::random(), containerClass, identifier,
+    auto record = std::make_shared<BTHMetadata>(kMobile, Uuid::random(), containerClass, identifier,
                                                 std::nullopt, url, std::nullopt);
-    BTHErrorRef error;
-    EXPECT_TRUE(record->writeMetadataToDisk(&error)) << (error ? error->description() : "");
+    EXPECT_TRUE(record->writeMetadataToDisk(nullptr));
     return record;
+}
+
+BTHMetadataRef find(uint64_t containerClass, const std::string& identifier, bool transient = false,
+                    BTHErrorRef* error = nullptr) {
+    return cache().containerForUser(kMobile, containerClass, identifier, transient, error);
+}
+
+Strings identifiersOf(uint64_t containerClass, bool transient = false) {
+    return cache()
+        .allContainerIdentifiersForUser(kMobile, containerClass, transient, nullptr)
+        .value_or(Strings{"(failed)"});
 }
 
 void expectError(const BTHErrorRef& error, int32_t code, const std::string& message) {
@@ -61,22 +65,30 @@ void expectError(const BTHErrorRef& error, int32_t code, const std::string& mess
 
 // Lines of `level` whose message is exactly `message`.
 size_t countLines(const LogCapture& log, int level, const std::string& message) {
-    size_t n = 0;
-    for (const LogCapture::Line& line : log.lines())
-        if (line.level == level && line.message == message) ++n;
-    return n;
+    const auto lines = log.lines();
+    return std::count_if(lines.begin(), lines.end(), [&](const LogCapture::Line& line) {
+        return line.level == level && line.message == message;
+    });
 }
 
 size_t rebuilds(const LogCapture& log, const std::string& mapName) {
     return countLines(log, BTHLogLevelDebug, "Rebuilding container class cache: " + mapName);
 }
 
-Strings identifiersOf(uid_t user, uint64_t containerClass, bool transient = false) {
-    BTHErrorRef error;
-    auto identifiers =
-        cache().allContainerIdentifiersForUser(user, containerClass, transient, &error);
-    EXPECT_TRUE(identifiers.has_value()) << (error ? error->description() : "");
-    return identifiers.value_or(Strings{});
+// The errors of the five operations that need the class map, in the order
+// look-up, listing, identifiers, addition, removal.
+std::vector<BTHErrorRef> errorsOfEveryOperation(uid_t user, uint64_t containerClass,
+                                                bool transient) {
+    auto record = std::make_shared<BTHMetadata>(user, Uuid::random(), containerClass, "com.new",
+                                                std::nullopt, "/c", std::nullopt);
+    std::vector<BTHErrorRef> errors(5);
+    EXPECT_FALSE(cache().containerForUser(user, containerClass, "x", transient, &errors[0]));
+    EXPECT_FALSE(cache().allContainersForUser(user, containerClass, transient, &errors[1]));
+    EXPECT_FALSE(
+        cache().allContainerIdentifiersForUser(user, containerClass, transient, &errors[2]));
+    EXPECT_FALSE(cache().addContainerMetadata(record, user, "/c", transient, &errors[3]));
+    EXPECT_FALSE(cache().removeContainerForUser(user, containerClass, "x", transient, &errors[4]));
+    return errors;
 }
 
 class BTHContainerCacheTest : public ::testing::Test {
@@ -85,8 +97,6 @@ class BTHContainerCacheTest : public ::testing::Test {
         BERTH_REQUIRE_ROOT();
         ASSERT_TRUE(kRootInstalled);
         cache().resetForTesting();
-        // Every class directory used here starts empty (a link or file left
-        // by a test is removed, not followed).
         for (uint64_t containerClass : {kData, kPlugin, kVPN})
             for (bool transient : {false, true})
                 fs::remove_all(classDirectory(kMobile, containerClass, transient));
@@ -94,35 +104,31 @@ class BTHContainerCacheTest : public ::testing::Test {
 };
 
 TEST_F(BTHContainerCacheTest, FirstLookUpBuildsTheMapAndLaterLookUpsNeverListAgain) {
-    BTHMetadataRef a = makeContainer(kMobile, kData, "com.example.a");
+    BTHMetadataRef a = makeContainer(kData, "com.a");
     LogCapture log;
-    BTHErrorRef error;
-    BTHMetadataRef found = cache().containerForUser(kMobile, kData, "com.example.a", false, &error);
-    ASSERT_NE(found, nullptr) << (error ? error->description() : "");
+    BTHMetadataRef found = find(kData, "com.a");
+    ASSERT_NE(found, nullptr);
     EXPECT_EQ(*found, *a);
-    EXPECT_EQ(rebuilds(log, "501-Data/Application"), 1u);
-    EXPECT_EQ(countLines(log, BTHLogLevelDebug,
-                         "Cache: Data/Application: Found Identifier: com.example.a"),
+    EXPECT_EQ(countLines(log, BTHLogLevelDebug, "Cache: Data/Application: Found Identifier: com.a"),
               1u);
 
-    // A container made behind the cache's back is not seen: the directory is
-    // not listed again, and the miss is not logged.
-    makeContainer(kMobile, kData, "com.example.b");
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.b", false, &error), nullptr);
+    // Made behind the cache's back: not seen, and the miss is not logged.
+    makeContainer(kData, "com.b");
+    BTHErrorRef error;
+    EXPECT_EQ(find(kData, "com.b", false, &error), nullptr);
     expectError(error, BTHErrorNotFound,
-                "Cache: Data/Application: Container Not Found with ID: com.example.b");
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.a", false, nullptr), found);
+                "Cache: Data/Application: Container Not Found with ID: com.b");
+    EXPECT_EQ(find(kData, "com.a"), found);
     EXPECT_EQ(rebuilds(log, "501-Data/Application"), 1u);
-
-    // The transient map is separate, built on its own.
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.a", true, &error), nullptr);
+    // The transient map is separate.
+    EXPECT_EQ(find(kData, "com.a", true, &error), nullptr);
     expectError(error, BTHErrorNotFound,
-                "Cache: Data/Application(transient): Container Not Found with ID: com.example.a");
+                "Cache: Data/Application(transient): Container Not Found with ID: com.a");
     EXPECT_EQ(rebuilds(log, "501-Data/Application(transient)"), 1u);
     EXPECT_FALSE(log.contains(BTHLogLevelError, "Not Found"));
 
     cache().resetForTesting();
-    EXPECT_NE(cache().containerForUser(kMobile, kData, "com.example.b", false, nullptr), nullptr);
+    EXPECT_NE(find(kData, "com.b"), nullptr);
     EXPECT_EQ(rebuilds(log, "501-Data/Application"), 2u);
 }
 
@@ -130,13 +136,12 @@ TEST_F(BTHContainerCacheTest, BadClassesAndUsersFailWith47BeforeTouchingTheDisk)
     struct Row {
         uid_t user;
         uint64_t containerClass;
-        std::string message;     // of the look-up, listing and removal
-        std::string addMessage;  // of the addition
+        std::string message;
+        std::string addMessage;  // when the addition words it differently
     };
     const Row rows[] = {
         {501, 1, "Invalid cache get-userId 501 for class 1", ""},
         {499, 3, "Invalid cache get-userId 499 for class 3", ""},
-        {501, 12, "Invalid cache get-userId 501 for class 12", ""},
         {33, 13, "Invalid cache get-userId 33 for class 13", ""},
         {501, 0, "Invalid Content Class: 0", "Invalid Metadata Content Class: 0"},
         {501, 14, "Invalid Content Class: 14", "Invalid Metadata Content Class: 14"},
@@ -145,61 +150,34 @@ TEST_F(BTHContainerCacheTest, BadClassesAndUsersFailWith47BeforeTouchingTheDisk)
         SCOPED_TRACE(row.message);
         std::optional<fs::path> directory;
         if (BTHContainerClassIsGlobal(row.containerClass)) {
-            directory =
-                classDirectory(BTHContainerClassGlobalUser(row.containerClass), row.containerClass);
+            directory = classDirectory(0, row.containerClass);
             fs::remove_all(*directory);
         }
-        const std::string addMessage = row.addMessage.empty() ? row.message : row.addMessage;
-        auto record =
-            std::make_shared<BTHMetadata>(row.user, Uuid::random(), row.containerClass,
-                                          "com.example.bad", std::nullopt, "/", std::nullopt);
         LogCapture log;
-        BTHErrorRef error;
-        EXPECT_EQ(cache().containerForUser(row.user, row.containerClass, "x", false, &error),
-                  nullptr);
-        expectError(error, BTHErrorCacheInvalidInput, row.message);
-        EXPECT_FALSE(cache().allContainersForUser(row.user, row.containerClass, false, &error));
-        expectError(error, BTHErrorCacheInvalidInput, row.message);
-        EXPECT_FALSE(
-            cache().allContainerIdentifiersForUser(row.user, row.containerClass, true, &error));
-        expectError(error, BTHErrorCacheInvalidInput, row.message);
-        EXPECT_FALSE(
-            cache().removeContainerForUser(row.user, row.containerClass, "x", false, &error));
-        expectError(error, BTHErrorCacheInvalidInput, row.message);
-        EXPECT_FALSE(cache().addContainerMetadata(record, row.user, "/c", false, &error));
-        expectError(error, BTHErrorCacheInvalidInput, addMessage);
-
-        // Each failure is logged once, and nothing else is.
-        size_t errorLines = 0;
-        for (const LogCapture::Line& line : log.lines())
-            errorLines += line.level == BTHLogLevelError;
-        EXPECT_EQ(errorLines, 5u);
-        EXPECT_EQ(log.count(BTHLogLevelError, row.message), addMessage == row.message ? 5u : 4u);
-        EXPECT_EQ(log.count(BTHLogLevelDebug, "Rebuilding"), 0u);
+        const auto errors = errorsOfEveryOperation(row.user, row.containerClass, false);
+        for (size_t i = 0; i < errors.size(); ++i)
+            expectError(errors[i], BTHErrorCacheInvalidInput,
+                        i == 3 && !row.addMessage.empty() ? row.addMessage : row.message);
+        EXPECT_EQ(log.lines().size(), 5u);  // each logged once, nothing else
         if (directory) {
-            EXPECT_FALSE(fs::exists(fs::symlink_status(*directory))) << *directory;
+            EXPECT_FALSE(fs::exists(fs::symlink_status(*directory)));
         }
     }
 
-    // Records and urls the cache cannot hold.
-    auto record = std::make_shared<BTHMetadata>(kMobile, Uuid::random(), kData, "com.example.a",
+    auto record = std::make_shared<BTHMetadata>(kMobile, Uuid::random(), kData, "com.a",
                                                 std::nullopt, "/", std::nullopt);
-    const std::pair<std::string, std::string> urls[] = {
-        {"relative/dir", "Invalid input: URL: relative/dir"}, {"", "Invalid input: URL: "}};
     BTHErrorRef error;
-    for (const auto& [url, message] : urls) {
-        EXPECT_FALSE(cache().addContainerMetadata(record, kMobile, url, false, &error));
-        expectError(error, BTHErrorCacheInvalidInput, message);
-    }
+    EXPECT_FALSE(cache().addContainerMetadata(record, kMobile, "relative/dir", false, &error));
+    expectError(error, BTHErrorCacheInvalidInput, "Invalid input: URL: relative/dir");
     EXPECT_FALSE(cache().addContainerMetadata(nullptr, kMobile, "/c", false, &error));
     expectError(error, BTHErrorCacheInvalidInput, "Invalid metadata Identifier: (null)");
     EXPECT_EQ(record->url(), "/");
 }
 
 TEST_F(BTHContainerCacheTest, MissingMetadataFileGives44OnLookUpAndIsLeftOutOfTheListing) {
-    BTHMetadataRef a = makeContainer(kMobile, kData, "com.example.a");
-    BTHMetadataRef b = makeContainer(kMobile, kData, "com.example.b");
-    ASSERT_NE(cache().containerForUser(kMobile, kData, "com.example.a", false, nullptr), nullptr);
+    BTHMetadataRef a = makeContainer(kData, "com.a");
+    makeContainer(kData, "com.b");
+    ASSERT_NE(find(kData, "com.a"), nullptr);
     const fs::path metadataFile = BTHMetadata::metadataFileURL(a->url());
     ASSERT_TRUE(fs::remove(metadataFile));
 
@@ -207,40 +185,35 @@ TEST_F(BTHContainerCacheTest, MissingMetadataFileGives44OnLookUpAndIsLeftOutOfTh
     const std::string message =
         "Cache: Data/Application: INCONSISTENT-No Metadata at: " + metadataFile.string();
     BTHErrorRef error;
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.a", false, &error), nullptr);
+    EXPECT_EQ(find(kData, "com.a", false, &error), nullptr);
     expectError(error, BTHErrorCacheInconsistent, message);
-
     error.reset();
     auto all = cache().allContainersForUser(kMobile, kData, false, &error);
     ASSERT_TRUE(all.has_value());
     EXPECT_EQ(error, nullptr);
     ASSERT_EQ(all->size(), 1u);
-    EXPECT_EQ((*all)[0]->identifier(), "com.example.b");
+    EXPECT_EQ((*all)[0]->identifier(), "com.b");
     EXPECT_EQ(log.count(BTHLogLevelError, message), 2u);
-    EXPECT_EQ(countLines(log, BTHLogLevelDebug,
-                         "Cache: Data/Application: ALL Found Identifier: com.example.b"),
-              1u);
-    // The identifiers are not checked against the disk, and the entry stays:
-    // once its file is back it is found again without a rebuild.
-    EXPECT_EQ(identifiersOf(kMobile, kData), (Strings{"com.example.a", "com.example.b"}));
+
+    // The entry stays: once its file is back it is found without a rebuild.
+    EXPECT_EQ(identifiersOf(kData), (Strings{"com.a", "com.b"}));
     ASSERT_TRUE(a->writeMetadataToDisk(nullptr));
-    EXPECT_NE(cache().containerForUser(kMobile, kData, "com.example.a", false, nullptr), nullptr);
+    EXPECT_NE(find(kData, "com.a"), nullptr);
     EXPECT_EQ(log.count(BTHLogLevelDebug, "Rebuilding"), 0u);
 }
 
 TEST_F(BTHContainerCacheTest, BuildHoldsOneEntryPerIdentifierAndSkipsWhatDoesNotValidate) {
-    BTHMetadataRef first = makeContainer(kMobile, kData, "com.example.dup");
-    BTHMetadataRef second = makeContainer(kMobile, kData, "com.example.dup");
+    BTHMetadataRef first = makeContainer(kData, "com.dup");
+    BTHMetadataRef second = makeContainer(kData, "com.dup");
     const fs::path directory = classDirectory(kMobile, kData);
     test::writeFile(directory / "stray-file", "x");
     fs::create_directory(directory / "no-metadata");
-    // A container of another class, and one of another user, in this directory.
-    BTHMetadataRef misplaced = makeContainer(kMobile, kData, "com.example.misplaced");
-    misplaced->setContainerClass(kPlugin);
-    ASSERT_TRUE(misplaced->writeMetadataToDisk(nullptr));
-    BTHMetadataRef foreign = makeContainer(kMobile, kData, "com.example.foreign");
-    foreign->setUid(502);
-    ASSERT_TRUE(foreign->writeMetadataToDisk(nullptr));
+    BTHMetadataRef otherClass = makeContainer(kData, "com.other-class");
+    otherClass->setContainerClass(kPlugin);
+    BTHMetadataRef otherUser = makeContainer(kData, "com.other-user");
+    otherUser->setUid(502);
+    ASSERT_TRUE(otherClass->writeMetadataToDisk(nullptr) &&
+                otherUser->writeMetadataToDisk(nullptr));
 
     auto all = cache().allContainersForUser(kMobile, kData, false, nullptr);
     ASSERT_TRUE(all.has_value());
@@ -249,180 +222,105 @@ TEST_F(BTHContainerCacheTest, BuildHoldsOneEntryPerIdentifierAndSkipsWhatDoesNot
     auto listing =
         BTHFileManager::defaultManager().urlsForItemsInDirectoryAtURL(directory, nullptr);
     ASSERT_TRUE(listing.has_value());
-    auto position = [&](const fs::path& url) {
-        return std::find_if(listing->begin(), listing->end(),
-                            [&](const BTHFileURL& item) { return item.path == url; });
+    auto position = [&](const BTHMetadataRef& record) {
+        return std::find(listing->begin(), listing->end(), BTHFileURL{record->url(), true});
     };
-    const BTHMetadataRef& winner =
-        position(first->url()) < position(second->url()) ? second : first;
-    EXPECT_EQ(*(*all)[0], *winner);
-    EXPECT_EQ(identifiersOf(kMobile, kData), Strings{"com.example.dup"});
+    EXPECT_EQ(*(*all)[0], position(first) < position(second) ? *second : *first);
 }
 
-TEST_F(BTHContainerCacheTest, AddToANeverUsedClassBuildsItsMapFirst) {
-    BTHMetadataRef other = makeContainer(kMobile, kPlugin, "com.example.other");
+TEST_F(BTHContainerCacheTest, AddBuildsANeverUsedMapFirstAndAddRemoveChangeOnlyTheirMap) {
+    makeContainer(kPlugin, "com.other");
     // Made on disk, then added, as creation does: held once, as the added object.
-    BTHMetadataRef created = makeContainer(kMobile, kPlugin, "com.example.created");
+    BTHMetadataRef created = makeContainer(kPlugin, "com.created");
     const fs::path url = created->url();
     created->setUrl("/stale");
-
     LogCapture log;
-    BTHErrorRef error;
-    ASSERT_TRUE(cache().addContainerMetadata(created, kMobile, url, false, &error))
-        << (error ? error->description() : "");
+    ASSERT_TRUE(cache().addContainerMetadata(created, kMobile, url, false, nullptr));
     EXPECT_EQ(created->url(), url);
     EXPECT_EQ(rebuilds(log, "501-Data/SprocketPlugin"), 1u);
     EXPECT_EQ(countLines(log, BTHLogLevelDebug,
-                         "Cache: Data/SprocketPlugin: Added Identifier: com.example.created"),
+                         "Cache: Data/SprocketPlugin: Added Identifier: com.created"),
               1u);
-    EXPECT_EQ(identifiersOf(kMobile, kPlugin),
-              (Strings{"com.example.created", "com.example.other"}));
-    EXPECT_EQ(cache().containerForUser(kMobile, kPlugin, "com.example.created", false, nullptr),
-              created);
+    EXPECT_EQ(identifiersOf(kPlugin), (Strings{"com.created", "com.other"}));
+    EXPECT_EQ(find(kPlugin, "com.created"), created);
 
-    // A new record under the same identifier replaces the entry.
-    BTHMetadataRef replacement = makeContainer(kMobile, kPlugin, "com.example.created");
+    BTHMetadataRef replacement = makeContainer(kPlugin, "com.created");
     ASSERT_TRUE(
         cache().addContainerMetadata(replacement, kMobile, replacement->url(), false, nullptr));
-    EXPECT_EQ(identifiersOf(kMobile, kPlugin),
-              (Strings{"com.example.created", "com.example.other"}));
-    EXPECT_EQ(cache().containerForUser(kMobile, kPlugin, "com.example.created", false, nullptr),
-              replacement);
-    // Nothing went to the transient map.
-    EXPECT_EQ(identifiersOf(kMobile, kPlugin, true), Strings{});
+    EXPECT_EQ(identifiersOf(kPlugin), (Strings{"com.created", "com.other"}));
+    EXPECT_EQ(find(kPlugin, "com.created"), replacement);
+    EXPECT_EQ(identifiersOf(kPlugin, true), Strings{});
+
+    // Removal leaves the disk alone; an absent identifier is no error.
+    BTHErrorRef error;
+    EXPECT_TRUE(cache().removeContainerForUser(kMobile, kPlugin, "com.created", false, &error));
+    EXPECT_TRUE(cache().removeContainerForUser(kMobile, kPlugin, "com.created", false, &error));
+    EXPECT_TRUE(cache().removeContainerForUser(kMobile, kPlugin, "com.other", true, &error));
+    EXPECT_EQ(error, nullptr);
+    EXPECT_EQ(identifiersOf(kPlugin), Strings{"com.other"});
+    EXPECT_TRUE(fs::exists(BTHMetadata::metadataFileURL(replacement->url())));
+    EXPECT_EQ(countLines(log, BTHLogLevelDebug,
+                         "Cache: Data/SprocketPlugin: Removed Identifier: com.created"),
+              2u);
 }
 
 TEST_F(BTHContainerCacheTest, UuidLookUpMatchesTheUpperCaseStringAndSetsTheFlagOfItsMap) {
-    BTHMetadataRef live = makeContainer(kMobile, kData, "com.example.app");
-    BTHMetadataRef transient = makeContainer(kMobile, kData, "com.example.app", true);
-
-    BTHMetadataRef found =
-        cache().containerForUser(kMobile, kData, "com.example.app", live->uuid().string());
-    ASSERT_NE(found, nullptr);
-    EXPECT_EQ(found->uuid(), live->uuid());
-    EXPECT_FALSE(found->transient());
-    BTHMetadataRef foundTransient =
-        cache().containerForUser(kMobile, kData, "com.example.app", transient->uuid().string());
-    ASSERT_NE(foundTransient, nullptr);
-    EXPECT_EQ(foundTransient->uuid(), transient->uuid());
-    EXPECT_TRUE(foundTransient->transient());
-
+    const std::string live = makeContainer(kData, "com.app")->uuid().string();
+    const std::string transient = makeContainer(kData, "com.app", true)->uuid().string();
+    auto byUuid = [](const std::string& identifier, const std::string& uuid) {
+        return cache().containerForUser(kMobile, kData, identifier, uuid);
+    };
+    BTHMetadataRef foundLive = byUuid("com.app", live);
+    BTHMetadataRef foundTransient = byUuid("com.app", transient);
+    ASSERT_TRUE(foundLive && foundTransient);
+    EXPECT_EQ(foundLive->uuid().string(), live);
+    EXPECT_EQ(foundTransient->uuid().string(), transient);
     // The flag follows the map, whatever the record said before.
-    found->setTransient(true);
+    foundLive->setTransient(true);
     foundTransient->setTransient(false);
-    EXPECT_FALSE(cache()
-                     .containerForUser(kMobile, kData, "com.example.app", live->uuid().string())
-                     ->transient());
-    EXPECT_TRUE(cache()
-                    .containerForUser(kMobile, kData, "com.example.app", transient->uuid().string())
-                    ->transient());
+    EXPECT_FALSE(byUuid("com.app", live)->transient());
+    EXPECT_TRUE(byUuid("com.app", transient)->transient());
 
-    std::string lower = live->uuid().string();
-    std::transform(lower.begin(), lower.end(), lower.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.app", lower), nullptr);
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.app", Uuid::random().string()),
-              nullptr);
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.none", live->uuid().string()),
-              nullptr);
+    std::string lower = live;
+    std::transform(lower.begin(), lower.end(), lower.begin(), ::tolower);
+    EXPECT_EQ(byUuid("com.app", lower), nullptr);
+    EXPECT_EQ(byUuid("com.none", live), nullptr);
 }
 
-TEST_F(BTHContainerCacheTest, RemoveDropsOnlyTheEntryOfItsMapAndAbsentIsNoError) {
-    BTHMetadataRef a = makeContainer(kMobile, kData, "com.example.a");
-    BTHMetadataRef b = makeContainer(kMobile, kData, "com.example.b");
-    LogCapture log;
-    BTHErrorRef error;
-    ASSERT_TRUE(cache().removeContainerForUser(kMobile, kData, "com.example.a", false, &error));
-    EXPECT_EQ(cache().containerForUser(kMobile, kData, "com.example.a", false, nullptr), nullptr);
-    EXPECT_TRUE(fs::exists(BTHMetadata::metadataFileURL(a->url())));  // the disk is not touched
-    EXPECT_TRUE(cache().removeContainerForUser(kMobile, kData, "com.example.a", false, &error));
-    EXPECT_TRUE(cache().removeContainerForUser(kMobile, kData, "com.example.b", true, &error));
-    EXPECT_EQ(error, nullptr);
-    EXPECT_EQ(identifiersOf(kMobile, kData), Strings{"com.example.b"});
-    EXPECT_EQ(countLines(log, BTHLogLevelDebug,
-                         "Cache: Data/Application: Removed Identifier: com.example.a"),
-              2u);
-    EXPECT_EQ(countLines(log, BTHLogLevelDebug,
-                         "Cache: Data/Application(transient): Removed Identifier: com.example.b"),
-              1u);
-}
-
-TEST_F(BTHContainerCacheTest, UnlistableClassDirectoryGives43AndNoMap) {
-    // A valid container behind the link shows the link is not followed.
+TEST_F(BTHContainerCacheTest, UnlistableClassDirectoryGives43AndLeavesNoMap) {
+    // A valid container behind the link: it must not be found through it.
     test::ScratchDir elsewhere;
     const fs::path linked = elsewhere / Uuid::random().string();
     fs::create_directory(linked);
-    ASSERT_TRUE(BTHMetadata(kMobile, Uuid::random(), kVPN, "com.example.linked", std::nullopt,
-                            linked, std::nullopt)
+    ASSERT_TRUE(BTHMetadata(kMobile, Uuid::random(), kVPN, "x", std::nullopt, linked, std::nullopt)
                     .writeMetadataToDisk(nullptr));
-    struct Row {
-        bool transient;
-        bool symlink;
-        std::string message;
-    };
-    const Row rows[] = {
-        {false, false, "Cache: 501-Data/VPNPlugin: Failed to rebuild"},
-        {true, true, "Cache: 501-Data/VPNPlugin(transient): Failed to rebuild"},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.message);
-        const fs::path directory = classDirectory(kMobile, kVPN, row.transient);
+    for (const bool transient : {false, true}) {
+        const std::string mapName =
+            transient ? "501-Data/VPNPlugin(transient)" : "501-Data/VPNPlugin";
+        SCOPED_TRACE(mapName);
+        const fs::path directory = classDirectory(kMobile, kVPN, transient);
         fs::remove_all(directory);
-        if (row.symlink)
+        if (transient)
             fs::create_directory_symlink(elsewhere.path(), directory);
         else
             test::writeFile(directory, "not a directory");
 
         LogCapture log;
-        auto record = std::make_shared<BTHMetadata>(
-            kMobile, Uuid::random(), kVPN, "com.example.new", std::nullopt, "/c", std::nullopt);
-        BTHErrorRef errors[5];
-        EXPECT_EQ(cache().containerForUser(kMobile, kVPN, "com.example.linked", row.transient,
-                                           &errors[0]),
-                  nullptr);
-        EXPECT_FALSE(cache().allContainersForUser(kMobile, kVPN, row.transient, &errors[1]));
-        EXPECT_FALSE(
-            cache().allContainerIdentifiersForUser(kMobile, kVPN, row.transient, &errors[2]));
-        EXPECT_FALSE(
-            cache().addContainerMetadata(record, kMobile, "/c", row.transient, &errors[3]));
-        EXPECT_FALSE(cache().removeContainerForUser(kMobile, kVPN, "x", row.transient, &errors[4]));
-        for (const BTHErrorRef& error : errors) {
-            expectError(error, BTHErrorCacheRebuildFailed, row.message);
+        const std::string message = "Cache: " + mapName + ": Failed to rebuild";
+        for (const BTHErrorRef& error : errorsOfEveryOperation(kMobile, kVPN, transient)) {
+            expectError(error, BTHErrorCacheRebuildFailed, message);
             ASSERT_NE(error->underlyingError(), nullptr);
             EXPECT_EQ(error->underlyingError()->domain(), kBTHPOSIXErrorDomain);
         }
-        EXPECT_EQ(log.count(BTHLogLevelError, row.message), 5u);
-        // Every use tried again: a failed build leaves no map behind.
-        EXPECT_EQ(
-            rebuilds(log, row.transient ? "501-Data/VPNPlugin(transient)" : "501-Data/VPNPlugin"),
-            5u);
+        EXPECT_EQ(log.count(BTHLogLevelError, message), 5u);
+        EXPECT_EQ(rebuilds(log, mapName), 5u);  // no map was kept
 
         fs::remove(directory);
-        BTHMetadataRef later = makeContainer(kMobile, kVPN, "com.example.later", row.transient);
-        BTHMetadataRef found =
-            cache().containerForUser(kMobile, kVPN, "com.example.later", row.transient, nullptr);
+        BTHMetadataRef later = makeContainer(kVPN, "com.later", transient);
+        BTHMetadataRef found = find(kVPN, "com.later", transient);
         ASSERT_NE(found, nullptr);
         EXPECT_EQ(found->uuid(), later->uuid());
     }
-}
-
-TEST_F(BTHContainerCacheTest, ConcurrentFirstUsersShareOneBuild) {
-    constexpr int kContainers = 50;
-    constexpr int kThreads = 4;
-    for (int i = 0; i < kContainers; ++i)
-        makeContainer(kMobile, kData, "com.example." + std::to_string(i));
-    LogCapture log;
-    std::vector<size_t> seen(kThreads);
-    {
-        std::vector<std::jthread> threads;
-        for (int t = 0; t < kThreads; ++t)
-            threads.emplace_back([&, t] {
-                auto all = cache().allContainersForUser(kMobile, kData, false, nullptr);
-                seen[t] = all ? all->size() : 0;
-            });
-    }
-    EXPECT_EQ(seen, std::vector<size_t>(kThreads, kContainers));
-    EXPECT_EQ(rebuilds(log, "501-Data/Application"), 1u);
 }
 
 }  // namespace
