@@ -388,16 +388,12 @@ void standardizeItemOwnership(const BTHWalkEntry& entry, uid_t uid, gid_t gid) {
     chmodItem(bthFunctionName, fd.get(), entry.path, executable ? 0755 : 0644);
 }
 
-// The root of a tree as a walk entry, for handling it again after the walk.
+// The root of a tree as an item to change, for handling it again after the
+// walk.
 BTHWalkEntry rootEntry(const std::filesystem::path& root, int parentFd, std::string name,
                        const struct stat& st) {
-    using Kind = BTHWalkEntry::Kind;
     BTHWalkEntry entry;
     entry.path = root;
-    entry.kind = S_ISDIR(st.st_mode)   ? Kind::DirectoryPre
-                 : S_ISREG(st.st_mode) ? Kind::File
-                 : S_ISLNK(st.st_mode) ? Kind::Symlink
-                                       : Kind::Other;
     entry.st = st;
     entry.parentFd = parentFd;
     entry.name = std::move(name);
