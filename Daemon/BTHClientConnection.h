@@ -26,6 +26,33 @@ namespace berth {
 
 using BTHMetadataRef = std::shared_ptr<BTHMetadata>;
 
+// The two containers of a replace. Without `oldUUID` there is no old
+// container and the new one goes to a permanent place.
+struct BTHReplaceRequest {
+    std::optional<Uuid> oldUUID;
+    std::optional<Uuid> newUUID;
+    uid_t oldUserId = 0;
+    uid_t newUserId = 0;
+    std::optional<std::string> oldIdentifier;
+    std::optional<std::string> newIdentifier;
+    uint64_t oldClass = 0;
+    uint64_t newClass = 0;
+    // The new contents take the old container's place and UUID.
+    bool preserveOldUUID = false;
+    bool startDeletionThread = false;
+};
+
+// What a replace journal records: where the old container was, where the new
+// one was, the staging directory that receives the old one, and where the
+// new one goes.
+struct BTHReplaceJournal {
+    std::filesystem::path oldURL;
+    std::filesystem::path newURL;
+    std::filesystem::path stagingURL;
+    std::filesystem::path destinationURL;
+    std::string description() const;
+};
+
 inline constexpr const char* kBTHInternalClientIdentifier = "sys.kelp.berthd.internal";
 
 class BTHClientConnection {
@@ -47,6 +74,7 @@ class BTHClientConnection {
     }
     uid_t clientUserId() const { return clientUserId_; }
     bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
+    void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
     bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
     void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
     const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const {
@@ -130,7 +158,72 @@ class BTHClientConnection {
     // moves it aside into the device's "/tmp".
     bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, BTHErrorRef* error);
 
+    // ----- Removal (BTHClientConnection+Delete.cpp)
+
+    // Stages each named container for deletion: one rename into death row,
+    // then out of the sandbox mapping and the cache. The four lists are
+    // index-aligned and must have the same length (11 otherwise). Entries
+    // that are malformed, unknown or cannot be moved are skipped (logged);
+    // a cache failure stops the walk. Death row is not emptied here.
+    void stageForDeleteContainersWithUsers(
+        const std::vector<uid_t>& users, const std::vector<std::optional<Uuid>>& uuids,
+        const std::optional<std::vector<std::optional<std::string>>>& identifiers,
+        const std::vector<Value>& classes, bool useLocking, uint64_t* error);
+    // Looks the container up and stages it; `error` is set to 1 first.
+    void deleteContainerForUser(uid_t userId, const std::optional<std::string>& identifier,
+                                uint64_t containerClass, bool transient, uint64_t* error);
+    // Gives a data container the contents of a new one while it keeps its
+    // UUID and path; the old contents go to death row. `error` is set to 1
+    // first.
+    void deleteDataContainerContentForUser(uid_t userId,
+                                           const std::optional<std::string>& identifier,
+                                           uint64_t containerClass, uint64_t* error);
+
+    // ----- Replace (BTHClientConnection+Replace.cpp)
+
+    // Puts the new container in the place of the old one (or, without an
+    // old one, moves it to a permanent place), journaled so that a crash at
+    // any point is finished or undone by the next start's recovery. A
+    // failed replace leaves the old container where it was.
+    void replaceContainer(const BTHReplaceRequest& request, uint64_t* error);
+    bool _writeToDiskReplaceAt(const std::filesystem::path& journal,
+                               const std::filesystem::path& oldURL,
+                               const std::filesystem::path& newURL,
+                               const std::filesystem::path& stagingURL,
+                               const std::filesystem::path& destinationURL, BTHErrorRef* error);
+    std::optional<BTHReplaceJournal> _readAndValidateReplaceFileAtUrl(
+        const std::filesystem::path& journal, BTHErrorRef* error);
+    // Finishes or undoes every replace whose journal is still on disk.
+    bool _recoverFromReplaceOperationsWithError(BTHErrorRef* error);
+
+    // ----- Regeneration (BTHClientConnection+Regenerate.cpp)
+
+    // Gives the container a fresh directory name in the same parent; its
+    // UUID, identifier, class and contents stay.
+    void regenerateDirectoryUUIDForUser(uid_t userId, const std::optional<Uuid>& uuid,
+                                        const std::optional<std::string>& identifier,
+                                        uint64_t containerClass, uint64_t* error);
+    // Every system container that is not well known, after a build upgrade.
+    void _regenerateAllSystemContainerPaths();
+
+    // ----- Start-up (BTHClientConnection+Setup.cpp)
+
+    // Every start: recovery of interrupted replaces.
+    void berthSetup();
+    // Every start, after the setup: staging leftovers to death row, then
+    // death row emptied.
+    void berthCleanup();
+
   private:
+    BTHErrorRef stageOneForDelete(uid_t userId, const std::optional<Uuid>& uuid,
+                                  const std::optional<std::string>& identifier,
+                                  const Value& classValue);
+    bool mayWipe(const std::string& identifier, uint64_t containerClass) const;
+    BTHErrorRef regenerateChosen(uid_t userId, const Uuid& uuid,
+                                 const std::optional<std::string>& identifier,
+                                 uint64_t containerClass);
+    BTHErrorRef regenerateOne(const BTHMetadataRef& record);
+
     // Steps of a create-or-look-up that need no lock: arguments, the user
     // for the class, and the right to a system container.
     BTHErrorRef checkCreateOrLookupRequest(uid_t userId,

@@ -72,6 +72,21 @@ class BTHCodeSigningMapping {
 
     static std::filesystem::path mappingFileURL();
 
+    // Removal and invalidation for the container operations that delete or
+    // replace bundle containers (BTHCodeSigningMapping+Removal.cpp). Both run
+    // on the queue and take no lock: their callers already hold the
+    // all-identifiers lock.
+    //
+    // Drops the entries of the identifier's children, then its own; failures
+    // are logged. (The re-counting of the identifier's groups that a removal
+    // implies comes with the group containers.)
+    void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier);
+    // Marks the identifier's entry and its children's entries invalid and
+    // rewrites the file (even when nothing was found); false with error 59
+    // when the write fails.
+    bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                              BTHErrorRef* error);
+
   private:
     // Only create() can name it, so only create() constructs.
     struct Passkey {};

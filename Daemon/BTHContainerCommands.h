@@ -27,5 +27,25 @@ void getContainerMetadata(const BTHRequestRef& request,
 void recreateDefaultStructure(const BTHRequestRef& request,
                               const std::shared_ptr<BTHClientConnection>& client,
                               uint64_t* replyError);
+void replaceContainer(const BTHRequestRef& request,
+                      const std::shared_ptr<BTHClientConnection>& client, uint64_t* replyError);
+void stageContainerForDelete(const BTHRequestRef& request,
+                             const std::shared_ptr<BTHClientConnection>& client,
+                             uint64_t* replyError);
+// Replies from the completion, once death row has been emptied.
+void deleteContainersOnDeathRow(const BTHRequestRef& request,
+                                const std::shared_ptr<BTHClientConnection>& client,
+                                uint64_t* replyError);
+void regenerateDirectoryUUID(const BTHRequestRef& request,
+                             const std::shared_ptr<BTHClientConnection>& client,
+                             uint64_t* replyError);
+void deleteContainer(const BTHRequestRef& request,
+                     const std::shared_ptr<BTHClientConnection>& client, uint64_t* replyError);
+// Only the plug-in data identifiers the caller is entitled to wipe.
+void wipePluginDataContainer(const BTHRequestRef& request,
+                             const std::shared_ptr<BTHClientConnection>& client,
+                             uint64_t* replyError);
+void wipeDataContainer(const BTHRequestRef& request,
+                       const std::shared_ptr<BTHClientConnection>& client, uint64_t* replyError);
 
 }  // namespace berth

@@ -156,8 +156,9 @@ int BTHDaemonMain() {
         // The once-per-boot setup of the container store runs here once the
         // store's maintenance operations are built into the daemon.
     }
-    // Every launch: recovery of interrupted replaces runs here once replace
-    // is built into the daemon.
+    const std::shared_ptr<BTHClientConnection>& daemonClient =
+        BTHClientConnection::sharedClientConnection();
+    daemonClient->berthSetup();
 
     std::unique_ptr<BTHUpcallServer> upcall = BTHUpcallServer::start(runLoop);
     if (!upcall) {
@@ -170,8 +171,7 @@ int BTHDaemonMain() {
         BTHLogNotice("berthd first boot cleanup complete");
         setFirstBootWorkCompleted();
     }
-    // Every launch: clean-up of staging leftovers and death row runs here
-    // once deletion is built into the daemon.
+    daemonClient->berthCleanup();
     RelayTransaction::end();
 
     const std::shared_ptr<WorkQueue> listenerQueue =

@@ -177,14 +177,15 @@ TEST_F(BerthctlTest, EntitlementMatrixThroughTheDaemon) {
         std::vector<std::pair<const char*, Value>> entitlements;
         // Expected reply errors of commands 0, 1, 11 and 24, sent without
         // keys: 55 when refused; otherwise what the handler answers (38 for
-        // a request naming no valid user, 49 for a handler not built yet).
+        // a request naming no valid user, 18 for a wipe naming no identifier,
+        // 49 for a handler not built yet).
         uint64_t expected[4];
     };
     const Client clients[] = {
         {"none", {}, {38, 55, 55, 55}},
-        {"allowed", {{"sys.kelp.private.Berth.allowed", true}}, {38, 38, 49, 49}},
+        {"allowed", {{"sys.kelp.private.Berth.allowed", true}}, {38, 38, 18, 49}},
         {"lookup", {{"sys.kelp.private.Berth.otherIdLookup", true}}, {38, 55, 55, 55}},
-        {"wiper", {{"sys.kelp.private.Berth.wipeContainer", wipeList}}, {38, 55, 49, 55}},
+        {"wiper", {{"sys.kelp.private.Berth.wipeContainer", wipeList}}, {38, 55, 18, 55}},
         {"wipeflag", {{"sys.kelp.private.Berth.wipeContainer", true}}, {38, 55, 55, 55}},
         {"migrator", {{"sys.kelp.private.Berth.dataMigration", true}}, {38, 55, 55, 49}},
     };
