@@ -40,6 +40,15 @@ void unlock_identifier(const std::string& identifier);
 void unlock_identifier(const std::vector<std::string>& identifiers);
 void unlock_identifier(const Value& identifiers);
 
+// A literal names one identifier (it would otherwise convert as readily to a
+// Value as to a string).
+inline void _lock_identifier(const char* identifier, bool forWriting) {
+    _lock_identifier(std::string(identifier), forWriting);
+}
+inline void unlock_identifier(const char* identifier) {
+    unlock_identifier(std::string(identifier));
+}
+
 void _lock_all_identifiers(bool forWriting);
 void unlock_all_identifiers();
 
