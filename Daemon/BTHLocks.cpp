@@ -9,7 +9,6 @@
 #include <functional>
 #include <memory>
 #include <mutex>
-#include <new>
 #include <string_view>
 #include <unordered_map>
 

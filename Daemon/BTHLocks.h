@@ -32,8 +32,8 @@ namespace berth {
 
 void _lock_identifier(const std::string& identifier, bool forWriting);
 void _lock_identifier(const std::vector<std::string>& identifiers, bool forWriting);
-// A string or an array of strings; anything else logs "Unknown parameter
-// type!" and ends the process.
+// A string or an array of strings; anything else (an array holding anything
+// but strings included) logs "Unknown parameter type!" and ends the process.
 void _lock_identifier(const Value& identifiers, bool forWriting);
 
 void unlock_identifier(const std::string& identifier);
