@@ -1,0 +1,450 @@
+// Container commands through a real berthd on a scratch device root, over
+// its request socket, as clients see them.
+//
+//   create   command 0 creating a container under a fresh identifier each
+//            time (class Data/Application, user 501)
+//   lookup   command 0 finding containers that exist, without creating
+//   rebuild  the first look-up in a class whose map the daemon has not built
+//            yet: the class directory holds N containers written before the
+//            daemon started, so that look-up reads and validates N metadata
+//            files; timed against the look-ups after it
+//
+// Each client thread owns one connection and sends one request at a time,
+// waiting for its reply; the throughput rows run 1 and 8 clients. The
+// rebuild is timed over several daemon starts (each start builds the map
+// anew; the files are in the page cache after the first).
+//
+//   container_bench <path of berthd> [seconds per throughput row, default 3]
+//                   [containers in the rebuilt class, default 10000]
+//                   [daemon starts for the rebuild, default 5]
+//
+// Run as root (the daemon must be able to own what it makes); the defaults
+// take about half a minute. The scratch device root is removed afterwards,
+// except when a run fails, for a look at the daemon's log.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "BTHGlobalConfiguration.h"
+#include "BTHMetadata.h"
+#include "core/RelayCodec.h"
+#include "platform/CodeSigningRegistry.h"
+#include "platform/NamedSemaphore.h"
+#include "platform/UniqueFd.h"
+
+namespace berth {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+constexpr uint64_t kDataApplication = 2;
+constexpr uint64_t kDataSprocketPlugin = 4;
+constexpr uint64_t kUser = 501;
+
+// Ends the run; main reports it after every daemon started is stopped.
+[[noreturn]] void die(const std::string& why) {
+    throw std::runtime_error(why);
+}
+
+double millisecondsSince(Clock::time_point start) {
+    return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
+}
+
+// One connection speaking the relay synchronously: a request, then its
+// reply. A daemon that keeps a request longer than kReplyPatience counts as
+// a broken connection.
+constexpr std::chrono::seconds kReplyPatience{30};
+
+class Client {
+  public:
+    explicit Client(const std::filesystem::path& socketPath) {
+        fd_.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
+        const timeval patience{kReplyPatience.count(), 0};
+        if (::setsockopt(fd_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience) != 0 ||
+            ::connect(fd_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
+            fd_.reset();
+    }
+    bool connected() const { return fd_.get() >= 0; }
+
+    // The reply; nullopt when the exchange failed.
+    std::optional<Value> exchange(const Value& request) {
+        frame_.clear();
+        if (!relay::encodeFrame({relay::FrameKind::Request, nextId_++, request}, frame_) ||
+            ::send(fd_.get(), frame_.data(), frame_.size(), MSG_NOSIGNAL) !=
+                static_cast<ssize_t>(frame_.size()) ||
+            !readFrame())
+            return std::nullopt;
+        Value reply;
+        if (!relay::decodeValue(
+                {reply_.data() + relay::kHeaderSize, reply_.size() - relay::kHeaderSize}, reply))
+            return std::nullopt;
+        return reply;
+    }
+
+    // The reply's "ReplyError"; 0 when the exchange failed.
+    uint64_t call(const Value& request) {
+        const std::optional<Value> reply = exchange(request);
+        const Value* code = reply ? reply->find("ReplyError") : nullptr;
+        return code ? code->uint64Value().value_or(0) : 0;
+    }
+
+  private:
+    bool readExactly(uint8_t* into, size_t size) {
+        for (size_t done = 0; done < size;) {
+            const ssize_t got = ::read(fd_.get(), into + done, size - done);
+            if (got <= 0) return false;
+            done += static_cast<size_t>(got);
+        }
+        return true;
+    }
+    bool readFrame() {
+        reply_.resize(relay::kHeaderSize);
+        if (!readExactly(reply_.data(), relay::kHeaderSize)) return false;
+        uint32_t length = 0;
+        for (int i = 0; i < 4; ++i) length |= uint32_t(reply_[12 + i]) << (8 * i);
+        reply_.resize(relay::kHeaderSize + length);
+        return readExactly(reply_.data() + relay::kHeaderSize, length);
+    }
+
+    UniqueFd fd_;
+    uint64_t nextId_ = 1;
+    std::vector<uint8_t> frame_, reply_;
+};
+
+Value lookupRequest(uint64_t containerClass, const std::string& identifier, bool create) {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{0});
+    request.set("ContainerClass", containerClass);
+    request.set("UserID", kUser);
+    request.set("Identifier", identifier);
+    request.set("CreateIfNecessary", create);
+    request.set("Transient", false);
+    return request;
+}
+
+std::string rebuiltIdentifier(uint64_t index) {
+    return "sys.kelp.bench.existing." + std::to_string(index);
+}
+
+// A berthd serving `root`; killed when the object goes.
+class Daemon {
+  public:
+    Daemon(const std::filesystem::path& binary, const std::filesystem::path& root)
+        : socket_(root / "run/berthd/sys.kelp.berthd") {
+        const std::filesystem::path output = root / "berthd.output";
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            const int fd = ::open(output.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
+            ::dup2(fd, STDOUT_FILENO);
+            ::dup2(fd, STDERR_FILENO);
+            ::execl(binary.c_str(), binary.c_str(), nullptr);
+            _exit(127);
+        }
+        for (int i = 0; i < 1000; ++i) {
+            if (Client(socket_).connected()) return;
+            if (::waitpid(pid_, nullptr, WNOHANG) == pid_)
+                die("berthd ended; see " + output.string());
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        }
+        stop();
+        die("berthd did not start serving; see " + output.string());
+    }
+    ~Daemon() { stop(); }
+    const std::filesystem::path& socket() const { return socket_; }
+
+  private:
+    void stop() {
+        ::kill(pid_, SIGKILL);
+        ::waitpid(pid_, nullptr, 0);
+        std::error_code ignored;
+        std::filesystem::remove(socket_, ignored);  // the next start must not find it early
+    }
+
+    std::filesystem::path socket_;
+    pid_t pid_ = -1;
+};
+
+// The accounts and homes of a device root, and this program signed in its
+// registry as a client that may act on other identifiers.
+void prepareRoot(const std::filesystem::path& root) {
+    std::filesystem::create_directories(root / "etc");
+    std::ofstream(root / "etc/passwd") << "root:x:0:0::/private/var/root:/bin/sh\n"
+                                          "_bundles:x:33:33::/private/var/ladingd:/bin/false\n"
+                                          "_system:x:499:499::/private/var/empty:/bin/false\n"
+                                          "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
+    std::ofstream(root / "etc/group") << "root:x:0:\n_bundles:x:33:\n_system:x:499:\n"
+                                         "systemusers:x:510:_system\nmobile:x:501:\n";
+    std::ofstream(root / "etc/os-release") << "VERSION_ID=0.1\nBUILD_ID=bench-1\n";
+    for (const auto& [home, owner] : {std::pair<const char*, uid_t>{"private/var/root", 0},
+                                      {"private/var/ladingd", 33},
+                                      {"private/var/empty", 499},
+                                      {"private/var/mobile", 501}}) {
+        std::filesystem::create_directories(root / home);
+        if (::chown((root / home).c_str(), owner, owner) != 0) die("chown " + std::string(home));
+    }
+    Value entitlements = Value::dictionary();
+    entitlements.set("sys.kelp.private.Berth.otherIdLookup", true);
+    entitlements.set("sys.kelp.private.Berth.allowed", true);  // the listing that checks the map
+    std::string why;
+    if (CodeSigningRegistry().sign(std::filesystem::read_symlink("/proc/self/exe"),
+                                   "sys.kelp.bench.containers", entitlements, &why) != 0)
+        die("sign: " + why);
+}
+
+// Writes `count` containers of user 501's Data/Application class directly
+// on disk, each a directory with a valid metadata file, written the way the
+// daemon writes it (durably, so several threads share the waits).
+void writeContainers(uint64_t count) {
+    const std::optional<std::filesystem::path> classDirectory =
+        BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+            static_cast<uid_t>(kUser), kDataApplication, false);
+    if (!classDirectory) die("no class directory for user 501");
+    constexpr uint64_t kWriters = 32;
+    std::atomic<bool> failed{false};
+    std::vector<std::thread> writers;
+    for (uint64_t w = 0; w < kWriters; ++w) {
+        writers.emplace_back([&, w] {
+            for (uint64_t i = w; i < count && !failed; i += kWriters) {
+                const std::filesystem::path url = *classDirectory / Uuid::random().string();
+                std::error_code ec;
+                std::filesystem::create_directory(url, ec);
+                BTHMetadata record(static_cast<uid_t>(kUser), Uuid::random(), kDataApplication,
+                                   rebuiltIdentifier(i), std::nullopt, url, std::nullopt);
+                if (ec || !record.writeMetadataToDisk(nullptr)) failed = true;
+            }
+        });
+    }
+    for (std::thread& writer : writers) writer.join();
+    if (failed) die("could not write the containers");
+}
+
+struct Rebuild {
+    double firstMilliseconds = 0;
+    double nextMilliseconds = 0;  // median of the look-ups after the first
+};
+
+// The number of containers command 1 lists for the class.
+size_t listedContainers(Client& client) {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{1});
+    request.set("ContainerClass", kDataApplication);
+    request.set("UserID", kUser);
+    const std::optional<Value> reply = client.exchange(request);
+    const Value* ids = reply ? reply->find("ReplyIdsArray") : nullptr;
+    return ids ? ids->size() : 0;
+}
+
+// One daemon start: the first look-up in the populated class against the
+// ones after it. A look-up in another class first takes the daemon's own
+// first-request costs out of the measurement. With `verify`, also checks
+// that the map holds every container written (that each file validated).
+Rebuild timeRebuild(const std::filesystem::path& binary, const std::filesystem::path& root,
+                    uint64_t count, bool verify) {
+    Daemon daemon(binary, root);
+    Client client(daemon.socket());
+    client.call(lookupRequest(kDataSprocketPlugin, "sys.kelp.bench.warm-up", false));
+    Rebuild result;
+    auto start = Clock::now();
+    if (client.call(lookupRequest(kDataApplication, rebuiltIdentifier(0), false)) != 1)
+        die("the first look-up in the populated class failed");
+    result.firstMilliseconds = millisecondsSince(start);
+    std::vector<double> next;
+    for (uint64_t i = 1; i <= 9; ++i) {
+        start = Clock::now();
+        if (client.call(
+                lookupRequest(kDataApplication, rebuiltIdentifier(i * 7919 % count), false)) != 1)
+            die("a look-up in the populated class failed");
+        next.push_back(millisecondsSince(start));
+    }
+    std::sort(next.begin(), next.end());
+    result.nextMilliseconds = next[next.size() / 2];
+    if (verify && listedContainers(client) != count)
+        die("the daemon's class map does not hold every container written");
+    return result;
+}
+
+struct Throughput {
+    double requestsPerSecond = 0;
+    double p50Microseconds = 0;
+    double p99Microseconds = 0;
+    uint64_t failures = 0;
+};
+
+// Runs `clients` threads, each sending makeRequest(client, n) for n = 0, 1,
+// ... on its own connection; measures after a short warm-up.
+Throughput measure(const std::filesystem::path& socket, int clients, double seconds,
+                   const std::function<Value(int client, uint64_t n)>& makeRequest) {
+    std::atomic<bool> measuring{false}, stop{false}, broken{false};
+    std::atomic<uint64_t> failures{0};
+    std::vector<std::vector<double>> latencies(clients);
+    std::vector<std::thread> threads;
+    for (int c = 0; c < clients; ++c) {
+        threads.emplace_back([&, c] {
+            Client client(socket);
+            std::vector<double>& mine = latencies[c];
+            for (uint64_t n = 0; !stop.load(std::memory_order_relaxed); ++n) {
+                const Value request = makeRequest(c, n);
+                const auto start = Clock::now();
+                const uint64_t code = client.connected() ? client.call(request) : 0;
+                if (code == 0) {
+                    broken = true;
+                    return;
+                }
+                if (!measuring.load(std::memory_order_relaxed)) continue;
+                if (code != 1) failures.fetch_add(1, std::memory_order_relaxed);
+                mine.push_back(
+                    std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+            }
+        });
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));  // warm-up
+    measuring = true;
+    const auto begin = Clock::now();
+    std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
+    measuring = false;
+    const double elapsed = std::chrono::duration<double>(Clock::now() - begin).count();
+    stop = true;
+    for (std::thread& thread : threads) thread.join();
+    if (broken) die("a connection to berthd broke or got no reply in time");
+
+    std::vector<double> all;
+    for (const std::vector<double>& mine : latencies)
+        all.insert(all.end(), mine.begin(), mine.end());
+    Throughput result;
+    result.failures = failures;
+    if (all.empty()) return result;
+    std::sort(all.begin(), all.end());
+    result.requestsPerSecond = static_cast<double>(all.size()) / elapsed;
+    result.p50Microseconds = all[all.size() / 2];
+    result.p99Microseconds = all[std::min(all.size() - 1, all.size() * 99 / 100)];
+    return result;
+}
+
+void printRow(const char* workload, int clients, const Throughput& result) {
+    std::printf("%-8s %7d %12.0f %10.1f %10.1f", workload, clients, result.requestsPerSecond,
+                result.p50Microseconds, result.p99Microseconds);
+    if (result.failures) std::printf("   (%llu failed)", (unsigned long long)result.failures);
+    std::printf("\n");
+}
+
+struct Settings {
+    std::filesystem::path berthd;
+    double seconds = 3;      // per throughput row
+    uint64_t count = 10000;  // containers in the rebuilt class
+    int starts = 5;          // daemon starts timing the rebuild
+};
+
+void run(const Settings& settings, const std::filesystem::path& root) {
+    prepareRoot(root);
+    const auto start = Clock::now();
+    writeContainers(settings.count);
+    std::printf("wrote %llu containers of Data/Application for user 501 in %.1f s\n",
+                (unsigned long long)settings.count, millisecondsSince(start) / 1000);
+
+    std::vector<Rebuild> rebuilds;
+    for (int i = 0; i < settings.starts; ++i)
+        rebuilds.push_back(timeRebuild(settings.berthd, root, settings.count, i == 0));
+    std::sort(rebuilds.begin(), rebuilds.end(), [](const Rebuild& a, const Rebuild& b) {
+        return a.firstMilliseconds < b.firstMilliseconds;
+    });
+    const Rebuild& median = rebuilds[rebuilds.size() / 2];
+    std::printf("%-8s %10s %12s %12s %14s %8s\n", "rebuild", "containers", "first ms", "fastest ms",
+                "next look-up ms", "ratio");
+    std::printf("%-8s %10llu %12.1f %12.1f %14.3f %7.0fx\n\n", "",
+                (unsigned long long)settings.count, median.firstMilliseconds,
+                rebuilds.front().firstMilliseconds, median.nextMilliseconds,
+                median.firstMilliseconds / median.nextMilliseconds);
+
+    Daemon daemon(settings.berthd, root);
+    std::printf("%-8s %7s %12s %10s %10s\n", "workload", "clients", "requests/s", "p50 us",
+                "p99 us");
+    for (int clients : {1, 8}) {
+        // Fresh identifiers in every row: "<clients>.<client>.<n>".
+        printRow(
+            "create", clients,
+            measure(daemon.socket(), clients, settings.seconds, [clients](int client, uint64_t n) {
+                return lookupRequest(kDataApplication,
+                                     "sys.kelp.bench.new." + std::to_string(clients) + "." +
+                                         std::to_string(client) + "." + std::to_string(n),
+                                     true);
+            }));
+    }
+    const uint64_t count = settings.count;
+    for (int clients : {1, 8}) {
+        printRow(
+            "lookup", clients,
+            measure(daemon.socket(), clients, settings.seconds, [count](int client, uint64_t n) {
+                // Each client walks the containers from its own start.
+                return lookupRequest(kDataApplication,
+                                     rebuiltIdentifier((n + client * 7919) % count), false);
+            }));
+    }
+}
+
+}  // namespace
+}  // namespace berth
+
+int main(int argc, char** argv) {
+    using namespace berth;
+    std::setvbuf(stdout, nullptr, _IOLBF, 0);  // rows appear as they are measured
+    if (argc < 2) {
+        std::fprintf(stderr,
+                     "usage: container_bench <path of berthd> [seconds per row, default 3] "
+                     "[containers in the rebuilt class, default 10000] [daemon starts for the "
+                     "rebuild, default 5]\n");
+        return 64;
+    }
+    Settings settings;
+    settings.berthd = std::filesystem::absolute(argv[1]);
+    if (argc > 2) settings.seconds = std::atof(argv[2]);
+    if (argc > 3) settings.count = std::strtoull(argv[3], nullptr, 10);
+    if (argc > 4) settings.starts = std::atoi(argv[4]);
+    if (settings.seconds <= 0 || settings.count == 0 || settings.starts < 1) {
+        std::fprintf(stderr, "container_bench: seconds, containers and starts must be positive\n");
+        return 64;
+    }
+
+    char scratch[] = "/tmp/container-bench.XXXXXX";
+    if (!::mkdtemp(scratch)) {
+        std::perror("mkdtemp");
+        return 1;
+    }
+    // The daemon modules this program uses read the device root once, from
+    // here: set it before any of them runs.
+    const std::filesystem::path root = std::filesystem::path(scratch) / "root";
+    ::setenv("BERTH_ROOT", root.c_str(), 1);
+    int status = 0;
+    try {
+        run(settings, root);
+    } catch (const std::exception& e) {
+        std::fprintf(stderr, "container_bench: %s (the device root stays at %s)\n", e.what(),
+                     root.c_str());
+        status = 1;
+    }
+    NamedSemaphore::remove("berthd.fb_check");  // the scratch root's first-boot marker
+    std::error_code ignored;
+    if (status == 0) std::filesystem::remove_all(scratch, ignored);
+    return status;
+}
