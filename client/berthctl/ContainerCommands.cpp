@@ -32,6 +32,12 @@ std::optional<ContainerSelector> selectorFor(const ContainerOptions& options, st
     selector.identifier = options.identifier;
     selector.transient = options.transient;
     if (!options.uuid.empty()) {
+        // The daemon finds a container by identifier and UUID together, and
+        // gives these commands no default identifier.
+        if (!options.identifier) {
+            *why = "--uuid needs --identifier too";
+            return std::nullopt;
+        }
         selector.uuid = Uuid::parse(options.uuid);
         if (!selector.uuid) {
             *why = "\"" + options.uuid + "\" is not a UUID (8-4-4-4-12 hexadecimal digits)";
@@ -46,12 +52,6 @@ int fail(const ContainerError& failure, std::ostream& err) {
     err << "error: " << failure.describe() << "\n";
     if (failure.isReplyError()) return kExitFailure;
     return failure.transport.code == BerthError::Code::InvalidRequest ? kExitUsage : kExitTransport;
-}
-
-// How a container is named in messages: its identifier, else its UUID.
-std::string nameOf(const ContainerSelector& selector) {
-    if (selector.identifier) return *selector.identifier;
-    return selector.uuid ? selector.uuid->string() : std::string("the caller's container");
 }
 
 void printField(std::ostream& out, std::string_view label, std::string_view text) {
@@ -112,11 +112,11 @@ int printMetadata(const ContainerMetadata& metadata, bool json, std::ostream& ou
 int printDone(const ContainerSelector& selector, std::string_view human, Value json, bool asJson,
               std::ostream& out) {
     if (asJson) {
-        json.set("identifier", nameOf(selector));
+        json.set("identifier", selector.identifier.value_or(""));
         if (selector.uuid) json.set("uuid", selector.uuid->string());
         out << valueToJson(json) << "\n";
     } else {
-        out << human << " " << nameOf(selector) << "\n";
+        out << human << " " << selector.identifier.value_or("") << "\n";
     }
     return kExitSuccess;
 }

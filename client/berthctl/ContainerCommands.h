@@ -34,8 +34,9 @@ struct ContainerOptions {
     // Absent: the caller's own identifier for create and lookup; for the
     // other commands the daemon gets none.
     std::optional<std::string> identifier;
-    // Canonical UUID text, or empty. The commands that address one existing
-    // container look it up first (command 0, never creating) when empty.
+    // Canonical UUID text, or empty; given, it needs an identifier too. The
+    // commands that address one existing container look it up first
+    // (command 0, never creating) when empty.
     std::string uuid;
     bool transient = false;
 

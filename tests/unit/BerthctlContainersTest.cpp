@@ -263,6 +263,7 @@ TEST(BerthctlContainersTest, CommandLineMistakesNeverReachTheDaemon) {
     good.containerClass = "Data/Application";
     good.socket = dir / "nobody-listens";
     good.action = ctl::ContainerAction::InfoSet;
+    good.identifier = "com.example.notes";
     good.uuid = kUuid.string();
     good.key = "k";
     good.value = R"({"uuid": "1b4e28ba-2fa1-11d2-883f-0016d3cca427"})";
@@ -279,6 +280,7 @@ TEST(BerthctlContainersTest, CommandLineMistakesNeverReachTheDaemon) {
          ctl::kExitUsage, "not a UUID"},
         {[](ctl::ContainerOptions& o) { o.value = "{\"uuid\": 5}"; }, ctl::kExitUsage,
          "typed JSON"},
+        {[](ctl::ContainerOptions& o) { o.identifier.reset(); }, ctl::kExitUsage, "--identifier"},
         // Well-formed, so it is sent, and fails for want of a daemon.
         {[](ctl::ContainerOptions&) {}, ctl::kExitTransport, "not running"},
     };
