@@ -355,21 +355,16 @@ BTHMetadataRef BTHClientConnection::createOrLookupContainerForUser(
     BTH_FUNCTION(kCreateFunction);
     std::optional<BTHAllIdentifiersLockGuard> lock;
     std::optional<CreateOrLookup> operation;
-    BTHErrorRef failure;
     BTHMetadataRef result;
-    try {
-        failure = checkCreateOrLookupRequest(userId, identifier, containerClass);
-        if (!failure) {
-            lock.emplace(true, useLocking);
-            operation.emplace(*this, userId, *identifier, containerClass, transient);
-            result = operation->run(createIfNecessary, &failure);
-        }
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-        result = nullptr;
-    }
+    BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() {
+        BTHErrorRef error = checkCreateOrLookupRequest(userId, identifier, containerClass);
+        if (error) return error;
+        lock.emplace(true, useLocking);
+        operation.emplace(*this, userId, *identifier, containerClass, transient);
+        result = operation->run(createIfNecessary, &error);
+        return error;
+    });
+    if (failure) result = nullptr;
     if (operation) operation->cleanUp(&failure);
     lock.reset();
     if (failure || !result) {

@@ -21,20 +21,6 @@ constexpr const char* kStageFunction =
     "-[BTHClientConnection "
     "stageForDeleteContainersWithUsers:UUIDs:identifiers:classes:useLocking:withError:]";
 
-// Runs `body` under the exception rule; a caught exception becomes the code
-// 40 error.
-template <class Body>
-BTHErrorRef underExceptionRule(const char* bthFunctionName, Body&& body) {
-    try {
-        return body();
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        BTHErrorRef error = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-        return error;
-    }
-}
-
 bool isDataClass(uint64_t containerClass) {
     switch (containerClass) {
         case 2:
@@ -110,7 +96,7 @@ void BTHClientConnection::stageForDeleteContainersWithUsers(
     const std::vector<Value>& classes, bool useLocking, uint64_t* error) {
     BTH_FUNCTION(kStageFunction);
     const size_t identifierCount = identifiers ? identifiers->size() : 0;
-    BTHErrorRef failure = underExceptionRule(bthFunctionName, [&]() -> BTHErrorRef {
+    BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() -> BTHErrorRef {
         // The users travel with the other three lists: all four must match.
         if (uuids.size() != classes.size() || uuids.size() != identifierCount ||
             users.size() != uuids.size()) {
@@ -138,22 +124,23 @@ void BTHClientConnection::deleteContainerForUser(uid_t userId,
         "-[BTHClientConnection deleteContainerForUser:withIdentifier:containerClass:transient:"
         "withError:]");
     uint64_t result = BTHErrorSuccess;
-    const BTHErrorRef failure = underExceptionRule(bthFunctionName, [&]() -> BTHErrorRef {
-        const BTHMetadataRef record = createOrLookupContainerForUser(
-            userId, identifier, false, containerClass, transient, true, &result);
-        if (!record) {
-            BTHLogError(
-                "Failed to lookup existing container to delete-identifier: %@, class: %ld, "
-                "transient: %d",
-                identifier, containerClass, transient);
+    const BTHErrorRef failure =
+        BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() -> BTHErrorRef {
+            const BTHMetadataRef record = createOrLookupContainerForUser(
+                userId, identifier, false, containerClass, transient, true, &result);
+            if (!record) {
+                BTHLogError(
+                    "Failed to lookup existing container to delete-identifier: %@, class: %ld, "
+                    "transient: %d",
+                    identifier, containerClass, transient);
+                return nullptr;
+            }
+            stageForDeleteContainersWithUsers(
+                {record->uid()}, {record->uuid()},
+                std::vector<std::optional<std::string>>{record->identifier()},
+                {Value(record->containerClass())}, true, &result);
             return nullptr;
-        }
-        stageForDeleteContainersWithUsers(
-            {record->uid()}, {record->uuid()},
-            std::vector<std::optional<std::string>>{record->identifier()},
-            {Value(record->containerClass())}, true, &result);
-        return nullptr;
-    });
+        });
     if (failure) result = failure->code64();
     BTHSetErrorCode(error, result);
 }
@@ -165,56 +152,61 @@ void BTHClientConnection::deleteDataContainerContentForUser(
         "-[BTHClientConnection deleteDataContainerContentForUser:identifier:containerClass:"
         "withError:]");
     uint64_t result = BTHErrorSuccess;
-    const BTHErrorRef failure = underExceptionRule(bthFunctionName, [&]() -> BTHErrorRef {
-        if (!identifier) {
-            BTHLogError("Can't wipe container with nil identifier: %@, userId: %u", identifier,
-                        userId);
-            result = BTHErrorIdentifierMissing;
-            return nullptr;
-        }
-        if (!isDataClass(containerClass)) {
-            BTHLogError(
-                "Can't wipe container non-data container of type: %llu, identifier: %@, userId: %u",
-                containerClass, identifier, userId);
-            result = BTHErrorInvalidArgument;
-            return nullptr;
-        }
-        if (!allowOtherIdLookup_ && !mayWipe(*identifier, containerClass)) {
-            if (containerClass == BTHContainerClassDataSprocketPlugin) {
-                BTHLogError("Not entitled to wipe container with identifier: %@", identifier);
-                result = BTHErrorNotEntitled;
-            } else {
-                BTHLogError("Can't wipe container with of type: %llu, identifier: %@, userId: %u",
-                            containerClass, identifier, userId);
-                result = BTHErrorInvalidArgument;
+    const BTHErrorRef failure =
+        BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() -> BTHErrorRef {
+            if (!identifier) {
+                BTHLogError("Can't wipe container with nil identifier: %@, userId: %u", identifier,
+                            userId);
+                result = BTHErrorIdentifierMissing;
+                return nullptr;
             }
+            if (!isDataClass(containerClass)) {
+                BTHLogError(
+                    "Can't wipe container non-data container of type: %llu, identifier: %@, "
+                    "userId: %u",
+                    containerClass, identifier, userId);
+                result = BTHErrorInvalidArgument;
+                return nullptr;
+            }
+            if (!allowOtherIdLookup_ && !mayWipe(*identifier, containerClass)) {
+                if (containerClass == BTHContainerClassDataSprocketPlugin) {
+                    BTHLogError("Not entitled to wipe container with identifier: %@", identifier);
+                    result = BTHErrorNotEntitled;
+                } else {
+                    BTHLogError(
+                        "Can't wipe container with of type: %llu, identifier: %@, userId: %u",
+                        containerClass, identifier, userId);
+                    result = BTHErrorInvalidArgument;
+                }
+                return nullptr;
+            }
+            const BTHMetadataRef existing = createOrLookupContainerForUser(
+                userId, identifier, false, containerClass, false, true, &result);
+            if (!existing) {
+                BTHLogError("Failed to lookup existing container to wipe-identifier: %@",
+                            identifier);
+                return nullptr;
+            }
+            const BTHMetadataRef fresh = createOrLookupContainerForUser(
+                userId, identifier, true, containerClass, true, true, &result);
+            if (!fresh) {
+                BTHLogError("Failed to create transient container for wipe-identifier: %@",
+                            identifier);
+                return nullptr;
+            }
+            BTHReplaceRequest replace;
+            replace.oldUUID = existing->uuid();
+            replace.newUUID = fresh->uuid();
+            replace.oldUserId = replace.newUserId = userId;
+            replace.oldIdentifier = replace.newIdentifier = identifier;
+            replace.oldClass = replace.newClass = containerClass;
+            replace.preserveOldUUID = true;
+            replace.startDeletionThread = true;
+            replaceContainer(replace, &result);
+            if (result != BTHErrorSuccess)
+                BTHLogError("Failed replace operation during delete all content");
             return nullptr;
-        }
-        const BTHMetadataRef existing = createOrLookupContainerForUser(
-            userId, identifier, false, containerClass, false, true, &result);
-        if (!existing) {
-            BTHLogError("Failed to lookup existing container to wipe-identifier: %@", identifier);
-            return nullptr;
-        }
-        const BTHMetadataRef fresh = createOrLookupContainerForUser(
-            userId, identifier, true, containerClass, true, true, &result);
-        if (!fresh) {
-            BTHLogError("Failed to create transient container for wipe-identifier: %@", identifier);
-            return nullptr;
-        }
-        BTHReplaceRequest replace;
-        replace.oldUUID = existing->uuid();
-        replace.newUUID = fresh->uuid();
-        replace.oldUserId = replace.newUserId = userId;
-        replace.oldIdentifier = replace.newIdentifier = identifier;
-        replace.oldClass = replace.newClass = containerClass;
-        replace.preserveOldUUID = true;
-        replace.startDeletionThread = true;
-        replaceContainer(replace, &result);
-        if (result != BTHErrorSuccess)
-            BTHLogError("Failed replace operation during delete all content");
-        return nullptr;
-    });
+        });
     if (failure) result = failure->code64();
     BTHSetErrorCode(error, result);
 }

@@ -23,38 +23,27 @@ void withContainer(const char* bthFunctionName, uid_t userId, const std::optiona
                    const std::optional<std::string>& identifier, uint64_t containerClass,
                    LockMode mode, uint64_t* error, const std::function<BTHErrorRef()>& checkKey,
                    Work&& work) {
-    BTHErrorRef failure;
-    try {
+    const BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&] {
         if (!uuid || !BTHContainerClassIsValid(containerClass)) {
-            failure = BTHMakeError(BTHErrorInvalidArgument, nullptr,
-                                   "Can't act on an invalid object: userId: %u, UUID: %@, "
-                                   "Class: %ld",
-                                   userId, uuid, containerClass);
-        } else if (checkKey) {
-            failure = checkKey();
+            return BTHMakeError(BTHErrorInvalidArgument, nullptr,
+                                "Can't act on an invalid object: userId: %u, UUID: %@, Class: %ld",
+                                userId, uuid, containerClass);
         }
-        if (!failure) {
-            const std::string uuidString = uuid->string();
-            BTHIdentifierLockGuard lock(uuidString, mode == LockMode::writing,
-                                        mode != LockMode::none);
-            BTHMetadataRef record = identifier
-                                        ? BTHContainerCache::sharedInstance().containerForUser(
-                                              userId, containerClass, *identifier, uuidString)
-                                        : nullptr;
-            if (!record) {
-                failure = BTHMakeError(BTHErrorNotFound, nullptr,
-                                       "No Container with userId: %u UUID: %@, identifier: %@, "
-                                       "Class: %ld",
-                                       userId, uuidString, identifier, containerClass);
-            } else {
-                failure = work(record);
-            }
+        if (checkKey) {
+            if (BTHErrorRef refused = checkKey()) return refused;
         }
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-    }
+        const std::string uuidString = uuid->string();
+        BTHIdentifierLockGuard lock(uuidString, mode == LockMode::writing, mode != LockMode::none);
+        BTHMetadataRef record = identifier ? BTHContainerCache::sharedInstance().containerForUser(
+                                                 userId, containerClass, *identifier, uuidString)
+                                           : nullptr;
+        if (!record) {
+            return BTHMakeError(BTHErrorNotFound, nullptr,
+                                "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
+                                userId, uuidString, identifier, containerClass);
+        }
+        return BTHErrorRef(work(record));
+    });
     if (failure) BTHSetErrorCode(error, failure->code64());
 }
 
@@ -67,24 +56,20 @@ LockMode lockModeFor(bool useLocking, LockMode mode) {
 std::optional<std::vector<BTHMetadataRef>> BTHClientConnection::containersForUser(
     uid_t userId, uint64_t containerClass, bool transient, uint64_t* error) {
     BTH_FUNCTION("-[BTHClientConnection containersForUser:withClass:transient:withError:]");
-    BTHErrorRef failure;
     std::optional<std::vector<BTHMetadataRef>> containers;
-    try {
+    const BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&] {
         if (!BTHContainerClassIsValid(containerClass)) {
-            failure = BTHMakeError(BTHErrorInvalidArgument, nullptr,
-                                   "Can't act on an invalid container-userId: %u, class: %ld",
-                                   userId, containerClass);
-        } else {
-            BTHAllIdentifiersLockGuard lock(false);
-            containers = BTHContainerCache::sharedInstance().allContainersForUser(
-                userId, containerClass, transient, &failure);
+            return BTHMakeError(BTHErrorInvalidArgument, nullptr,
+                                "Can't act on an invalid container-userId: %u, class: %ld", userId,
+                                containerClass);
         }
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-        containers.reset();
-    }
+        BTHAllIdentifiersLockGuard lock(false);
+        BTHErrorRef cacheError;
+        containers = BTHContainerCache::sharedInstance().allContainersForUser(
+            userId, containerClass, transient, &cacheError);
+        return cacheError;
+    });
+    if (failure) containers.reset();
     if (!containers) {
         BTHSetErrorCode(error, failure ? failure->code64() : uint64_t{BTHErrorNotFound});
     }

@@ -56,21 +56,14 @@ void BTHClientConnection::regenerateDirectoryUUIDForUser(
     uid_t userId, const std::optional<Uuid>& uuid, const std::optional<std::string>& identifier,
     uint64_t containerClass, uint64_t* error) {
     BTH_FUNCTION(kRegenerateFunction);
-    BTHErrorRef failure;
-    try {
+    const BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&] {
         if (!uuid || !BTHContainerClassIsValid(containerClass)) {
-            failure = BTHMakeError(BTHErrorInvalidArgument, nullptr,
-                                   "Can't act on an invalid object: userId: %u, UUID: %@, "
-                                   "Class: %ld",
-                                   userId, uuid, containerClass);
-        } else {
-            failure = regenerateChosen(userId, *uuid, identifier, containerClass);
+            return BTHMakeError(BTHErrorInvalidArgument, nullptr,
+                                "Can't act on an invalid object: userId: %u, UUID: %@, Class: %ld",
+                                userId, uuid, containerClass);
         }
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-    }
+        return regenerateChosen(userId, *uuid, identifier, containerClass);
+    });
     if (failure) BTHSetErrorCode(error, failure->code64());
 }
 

@@ -461,19 +461,14 @@ void BTHClientConnection::replaceContainer(const BTHReplaceRequest& request, uin
     BTH_FUNCTION(kReplaceFunction);
     std::optional<BTHAllIdentifiersLockGuard> lock;
     std::optional<Replace> replace;
-    BTHErrorRef failure;
-    try {
-        failure = checkReplaceRequest(request);
-        if (!failure) {
-            lock.emplace(true);
-            replace.emplace(*this, request);
-            replace->run(&failure);
-        }
-    } catch (...) {
-        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
-        failure = BTHCreateExceptionError(bthFunctionName, __LINE__, caught);
-        BTHReportCaughtException(caught);
-    }
+    BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() {
+        BTHErrorRef error = checkReplaceRequest(request);
+        if (error) return error;
+        lock.emplace(true);
+        replace.emplace(*this, request);
+        replace->run(&error);
+        return error;
+    });
     if (replace) replace->cleanUp(&failure);
     lock.reset();
     if (failure) BTHSetErrorCode(error, failure->code64());

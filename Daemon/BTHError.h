@@ -148,6 +148,21 @@ using BTHExceptionReporter = void (*)(const BTHCaughtException& exception);
 void BTHSetExceptionReporter(BTHExceptionReporter reporter);
 void BTHReportCaughtException(const BTHCaughtException& exception);
 
+// Runs `body`, which returns an error or null, under the exception rule: an
+// exception escaping it becomes the code-40 error (logged under `function`)
+// and is reported, and that error is the result.
+template <class Body>
+BTHErrorRef BTHRunUnderExceptionRule(const char* function, int line, Body&& body) {
+    try {
+        return body();
+    } catch (...) {
+        const BTHCaughtException caught = BTHCaughtException::from(std::current_exception());
+        BTHErrorRef error = BTHCreateExceptionError(function, line, caught);
+        BTHReportCaughtException(caught);
+        return error;
+    }
+}
+
 }  // namespace berth
 
 // The makers as the daemon's code uses them, under the enclosing function's
