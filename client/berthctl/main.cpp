@@ -6,6 +6,8 @@
 #include <CLI/CLI.hpp>
 #include <cmath>
 #include <iostream>
+#include <optional>
+#include <string>
 #include <vector>
 
 #include "CommandsListing.h"
@@ -34,27 +36,85 @@ std::chrono::milliseconds timeoutOf(double seconds) {
     return std::chrono::milliseconds(std::max<long long>(1, std::llround(seconds * 1000)));
 }
 
-// The options the container subcommands share: which container, and how to
-// reach the daemon.
-void addContainerOptions(CLI::App* command, ContainerAction action, Arguments& args) {
-    ContainerOptions& container = args.container;
-    command
-        ->add_option("--class", container.containerClass,
-                     "Container class: 1-13 or a name such as Data/Application")
-        ->required();
-    command->add_option("--user", args.user, "User id; 1 (default) is your own user");
-    if (action != ContainerAction::List)
-        command->add_option_function<std::string>(
-            "--identifier", [&container](const std::string& id) { container.identifier = id; },
-            "Container identifier (default: your own)");
-    if (action != ContainerAction::List && action != ContainerAction::Create &&
-        action != ContainerAction::Lookup)
-        command->add_option("--uuid", container.uuid,
-                            "The container's UUID (default: looked up by identifier)");
-    command->add_flag("--transient", container.transient, "A transient container");
+CLI::Option* addClassOption(CLI::App* command, Arguments& args) {
+    return command->add_option("--class", args.container.containerClass,
+                               "Container class: 1-13 or a name such as Data/Application");
+}
+
+CLI::Option* addIdentifierOption(CLI::App* command, const char* name, const char* description,
+                                 std::optional<std::string>& identifier) {
+    return command->add_option_function<std::string>(
+        name, [&identifier](const std::string& id) { identifier = id; }, description);
+}
+
+void addConnectionOptions(CLI::App* command, Arguments& args) {
     command->add_option("--socket", args.send.socket, "Request socket (default: the daemon's)");
     command->add_option("--timeout", args.timeoutSeconds, "Seconds to wait for a reply")
         ->check(CLI::PositiveNumber);
+}
+
+// The options the container subcommands share: which container, and how to
+// reach the daemon. Delete and wipe take no default identifier and no UUID
+// (the daemon finds the container by identifier). The commands that address
+// a container by UUID take no --transient: the UUID says which container it
+// is, and the look-up that finds a missing one finds permanent ones only.
+void addContainerOptions(CLI::App* command, ContainerAction action, Arguments& args) {
+    ContainerOptions& container = args.container;
+    using Action = ContainerAction;
+    const bool destroys = action == Action::Delete || action == Action::Wipe;
+    CLI::Option* containerClass = addClassOption(command, args);
+    if (action != Action::Wipe) containerClass->required();
+    command->add_option("--user", args.user, "User id; 1 (default) is your own user");
+    if (destroys)
+        addIdentifierOption(command, "--identifier", "Container identifier", container.identifier)
+            ->required();
+    else if (action != Action::List)
+        addIdentifierOption(command, "--identifier", "Container identifier (default: your own)",
+                            container.identifier);
+    if (action != Action::List && action != Action::Create && action != Action::Lookup && !destroys)
+        command->add_option("--uuid", container.uuid,
+                            "The container's UUID (default: looked up by identifier)");
+    if (action == Action::Wipe)
+        command
+            ->add_flag("--plugin", container.plugin,
+                       "Wipe a class 4 container (Data/SprocketPlugin) the caller is "
+                       "entitled to wipe, instead of one of --class")
+            ->excludes(containerClass);
+    const bool sendsTransient = action == Action::Create || action == Action::Lookup ||
+                                action == Action::List || action == Action::Delete;
+    if (sendsTransient)
+        command->add_flag("--transient", container.transient, "A transient container");
+    addConnectionOptions(command, args);
+}
+
+// The options of replace: the new container, and the old one it replaces.
+void addReplaceOptions(CLI::App* command, Arguments& args) {
+    ContainerOptions& container = args.container;
+    addClassOption(command, args)->required();
+    command->add_option("--user", args.user, "User id; 1 (default) is your own user");
+    addIdentifierOption(command, "--new-identifier",
+                        "The new container's identifier (default: your own)", container.identifier);
+    command->add_option("--new-uuid", container.uuid,
+                        "The new container's UUID; required for a transient one (default: the "
+                        "permanent container of the identifier)");
+    CLI::Option* oldIdentifier = addIdentifierOption(
+        command, "--old-identifier",
+        "The container to replace (default: none; the new one then becomes permanent)",
+        container.oldIdentifier);
+    command
+        ->add_option("--old-uuid", container.oldUuid,
+                     "The old container's UUID (default: looked up by identifier)")
+        ->needs(oldIdentifier);
+    command
+        ->add_option("--old-class", container.oldClass,
+                     "The old container's class (default: --class)")
+        ->needs(oldIdentifier);
+    command
+        ->add_option_function<uint32_t>(
+            "--old-user", [&container](uint32_t user) { container.oldUser = user; },
+            "The old container's user (default: --user)")
+        ->needs(oldIdentifier);
+    addConnectionOptions(command, args);
 }
 
 // Adds a container subcommand that runs `action`.
@@ -62,7 +122,24 @@ CLI::App* addContainerCommand(CLI::App& parent, const char* name, const char* de
                               ContainerAction action, Arguments& args) {
     CLI::App* command = parent.add_subcommand(name, description);
     command->callback([&args, action] { args.container.action = action; });
-    addContainerOptions(command, action, args);
+    switch (action) {
+        case ContainerAction::Replace:
+            addReplaceOptions(command, args);
+            break;
+        case ContainerAction::StageDelete:
+            command
+                ->add_option("--container", args.container.staged,
+                             "A container to stage: CLASS:USER:IDENTIFIER[:UUID] (UUID "
+                             "default: looked up); repeat for more")
+                ->required();
+            addConnectionOptions(command, args);
+            break;
+        case ContainerAction::EmptyDeathRow:
+            addConnectionOptions(command, args);
+            break;
+        default:
+            addContainerOptions(command, action, args);
+    }
     return command;
 }
 
@@ -157,6 +234,24 @@ int main(int argc, char** argv) {
                      "Send it as command 8 (default) or its twin 22")
         ->check(CLI::IsMember({8, 22}));
     containerCommands.insert(containerCommands.end(), {metadata, recreate});
+    const struct {
+        const char* name;
+        const char* description;
+        ContainerAction action;
+    } removals[] = {
+        {"replace", "Put one container in the place of another, or make a transient one permanent",
+         ContainerAction::Replace},
+        {"stage-delete", "Move containers to death row", ContainerAction::StageDelete},
+        {"empty-death-row", "Destroy what is on death row; returns when it is done",
+         ContainerAction::EmptyDeathRow},
+        {"regenerate", "Give a container's directory a new UUID name", ContainerAction::Regenerate},
+        {"delete", "Move a container, found by identifier, to death row", ContainerAction::Delete},
+        {"wipe", "Give a data container fresh contents, keeping its UUID and path",
+         ContainerAction::Wipe},
+    };
+    for (const auto& removal : removals)
+        containerCommands.push_back(
+            addContainerCommand(app, removal.name, removal.description, removal.action, args));
 
     try {
         app.parse(argc, argv);

@@ -63,6 +63,20 @@ Value containerRequest(uint64_t command, const ContainerSelector& selector) {
     return request;
 }
 
+// One side of a replace, under keys such as "OldContainerClass".
+void setReplaceSide(Value& request, const char* side, const ContainerSelector& selector) {
+    const std::string prefix(side);
+    request.set(prefix + "ContainerClass", selector.containerClass);
+    request.set(prefix + "ContainerUserID", selector.userId);
+    if (selector.identifier) request.set(prefix + "Identifier", *selector.identifier);
+    if (selector.uuid) request.set(prefix + "ContainerUUID", *selector.uuid);
+}
+
+// A request refused before it is sent.
+ContainerError invalidRequest(std::string why) {
+    return transportError(BerthError{BerthError::Code::InvalidRequest, 0, std::move(why)});
+}
+
 }  // namespace
 
 std::string ContainerError::describe() const {
@@ -166,6 +180,65 @@ Value makeMetadataRequest(const ContainerSelector& selector, bool infoRequested)
 
 Value makeRecreateDefaultStructureRequest(const ContainerSelector& selector, uint64_t command) {
     return containerRequest(command, selector);
+}
+
+Value makeReplaceRequest(const std::optional<ContainerSelector>& old,
+                         const ContainerSelector& replacement) {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{kBerthCommandReplace});
+    if (old) setReplaceSide(request, "Old", *old);
+    setReplaceSide(request, "New", replacement);
+    return request;
+}
+
+Value makeStageForDeleteRequest(const std::vector<ContainerSelector>& containers) {
+    Value classes = Value::array(), uuids = Value::array(), users = Value::array(),
+          identifiers = Value::array();
+    for (const ContainerSelector& container : containers) {
+        classes.push(container.containerClass);
+        uuids.push(container.uuid ? Value(*container.uuid) : Value());
+        users.push(container.userId);
+        identifiers.push(container.identifier ? Value(*container.identifier) : Value());
+    }
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{kBerthCommandStageForDelete});
+    request.set("ContainerClassesArray", std::move(classes));
+    request.set("UUIDsArray", std::move(uuids));
+    request.set("UserIDsArray", std::move(users));
+    request.set("IdentifiersArray", std::move(identifiers));
+    return request;
+}
+
+Value makeEmptyDeathRowRequest() {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{kBerthCommandEmptyDeathRow});
+    return request;
+}
+
+Value makeRegenerateDirectoryUUIDRequest(const ContainerSelector& selector) {
+    return containerRequest(kBerthCommandRegenerateDirectoryUUID, selector);
+}
+
+Value makeDeleteRequest(const ContainerSelector& selector) {
+    // The daemon finds the container to delete by identifier; a UUID has no say.
+    Value request = baseRequest(kBerthCommandDelete, selector);
+    if (selector.identifier) request.set("Identifier", *selector.identifier);
+    request.set("Transient", selector.transient);
+    return request;
+}
+
+Value makeWipePluginDataRequest(const ContainerSelector& selector) {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{kBerthCommandWipePluginData});
+    request.set("UserID", selector.userId);
+    if (selector.identifier) request.set("Identifier", *selector.identifier);
+    return request;
+}
+
+Value makeWipeDataRequest(const ContainerSelector& selector) {
+    Value request = baseRequest(kBerthCommandWipeData, selector);
+    if (selector.identifier) request.set("Identifier", *selector.identifier);
+    return request;
 }
 
 bool decodeReplyStatus(const Value& reply, ContainerError* error) {
@@ -272,9 +345,7 @@ std::optional<std::vector<ContainerListEntry>> BerthContainers::list(
 
 bool BerthContainers::setInfoValue(const ContainerSelector& selector, std::string_view key,
                                    const std::optional<Value>& value, ContainerError* error) {
-    const std::optional<Value> reply =
-        exchange(makeSetInfoValueRequest(selector, key, value), error);
-    return reply && decodeReplyStatus(*reply, error);
+    return call(makeSetInfoValueRequest(selector, key, value), error);
 }
 
 std::optional<Value> BerthContainers::infoValue(const ContainerSelector& selector,
@@ -291,11 +362,56 @@ std::optional<ContainerMetadata> BerthContainers::metadata(const ContainerSelect
     return reply ? decodeMetadataReply(*reply, error) : std::nullopt;
 }
 
+bool BerthContainers::call(const Value& request, ContainerError* error) {
+    const std::optional<Value> reply = exchange(request, error);
+    return reply && decodeReplyStatus(*reply, error);
+}
+
 bool BerthContainers::recreateDefaultStructure(const ContainerSelector& selector,
                                                ContainerError* error, uint64_t command) {
-    const std::optional<Value> reply =
-        exchange(makeRecreateDefaultStructureRequest(selector, command), error);
-    return reply && decodeReplyStatus(*reply, error);
+    return call(makeRecreateDefaultStructureRequest(selector, command), error);
+}
+
+bool BerthContainers::replace(const std::optional<ContainerSelector>& old,
+                              const ContainerSelector& replacement, ContainerError* error) {
+    if (old && !old->uuid) {
+        setError(error, invalidRequest("the old container of a replace needs its UUID"));
+        return false;
+    }
+    return call(makeReplaceRequest(old, replacement), error);
+}
+
+bool BerthContainers::stageForDelete(const std::vector<ContainerSelector>& containers,
+                                     ContainerError* error) {
+    for (size_t i = 0; i < containers.size(); ++i) {
+        if (!containers[i].identifier || !containers[i].uuid) {
+            setError(error, invalidRequest("container " + std::to_string(i) +
+                                           " to stage lacks its identifier or UUID"));
+            return false;
+        }
+    }
+    return call(makeStageForDeleteRequest(containers), error);
+}
+
+bool BerthContainers::emptyDeathRow(ContainerError* error) {
+    return call(makeEmptyDeathRowRequest(), error);
+}
+
+bool BerthContainers::regenerateDirectoryUUID(const ContainerSelector& selector,
+                                              ContainerError* error) {
+    return call(makeRegenerateDirectoryUUIDRequest(selector), error);
+}
+
+bool BerthContainers::deleteContainer(const ContainerSelector& selector, ContainerError* error) {
+    return call(makeDeleteRequest(selector), error);
+}
+
+bool BerthContainers::wipePluginData(const ContainerSelector& selector, ContainerError* error) {
+    return call(makeWipePluginDataRequest(selector), error);
+}
+
+bool BerthContainers::wipeData(const ContainerSelector& selector, ContainerError* error) {
+    return call(makeWipeDataRequest(selector), error);
 }
 
 }  // namespace berth

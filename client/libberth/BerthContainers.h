@@ -1,6 +1,6 @@
 // Typed calls of berthd's container commands: create or look up a container,
 // list a class, read and write info values, read metadata, recreate the
-// default structure.
+// default structure, and the commands that replace and remove containers.
 //
 //   berth::BerthError error;
 //   auto connection = berth::BerthConnection::connect(&error);
@@ -28,11 +28,26 @@
 //   6        infoValue                 class, user, identifier, UUID
 //   7        metadata                  class, user, identifier, UUID
 //   8, 22    recreateDefaultStructure  class, user, identifier, UUID
+//   2        replace                   both containers: class, user,
+//                                      identifier, UUID
+//   3        stageForDelete            each container: class, user,
+//                                      identifier, UUID
+//   4        emptyDeathRow             nothing
+//   9        regenerateDirectoryUUID   class, user, identifier, UUID
+//   10       deleteContainer           class, user, identifier, transient
+//   11       wipePluginData            user, identifier (the class is 4)
+//   12       wipeData                  class, user, identifier
 //
 // Commands other than 0 take no default identifier: the daemon answers a
 // request without one as it sees fit (usually BTHErrorNotFound). Absent
 // fields are left out of the request. Every command but 0 needs the
 // entitlement "sys.kelp.private.Berth.allowed".
+//
+// Removal is two-step: staging (3), deleting (10) and replacing (2) move a
+// container's directory to death row; emptying death row (4) destroys what
+// is there and replies only when it has finished. A wipe (11, 12) gives a
+// container fresh contents under its old UUID and path and starts emptying
+// death row by itself.
 #pragma once
 
 #include <chrono>
@@ -56,10 +71,17 @@ inline constexpr uint64_t kBerthCallerUserId = 1;
 enum BerthContainerCommand : uint64_t {
     kBerthCommandCreateOrLookup = 0,
     kBerthCommandList = 1,
+    kBerthCommandReplace = 2,
+    kBerthCommandStageForDelete = 3,
+    kBerthCommandEmptyDeathRow = 4,
     kBerthCommandSetInfoValue = 5,
     kBerthCommandGetInfoValue = 6,
     kBerthCommandMetadata = 7,
     kBerthCommandRecreateDefaultStructure = 8,
+    kBerthCommandRegenerateDirectoryUUID = 9,
+    kBerthCommandDelete = 10,
+    kBerthCommandWipePluginData = 11,
+    kBerthCommandWipeData = 12,
     // The same command under a second number; the daemon serves both alike.
     kBerthCommandRecreateDefaultStructureAlias = 22,
 };
@@ -128,6 +150,20 @@ Value makeMetadataRequest(const ContainerSelector& selector, bool infoRequested)
 // `command` is 8 or 22.
 Value makeRecreateDefaultStructureRequest(const ContainerSelector& selector,
                                           uint64_t command = kBerthCommandRecreateDefaultStructure);
+// Without `old` the "Old…" keys are left out and the daemon moves
+// `replacement` (usually a transient container) to a permanent place. The
+// daemon takes the old container as absent when its UUID is.
+Value makeReplaceRequest(const std::optional<ContainerSelector>& old,
+                         const ContainerSelector& replacement);
+// Four index-aligned arrays; an absent identifier or UUID is sent as null so
+// the entries after it stay aligned (the daemon skips that entry).
+Value makeStageForDeleteRequest(const std::vector<ContainerSelector>& containers);
+Value makeEmptyDeathRowRequest();
+Value makeRegenerateDirectoryUUIDRequest(const ContainerSelector& selector);
+Value makeDeleteRequest(const ContainerSelector& selector);
+// No "ContainerClass": the command always means class 4.
+Value makeWipePluginDataRequest(const ContainerSelector& selector);
+Value makeWipeDataRequest(const ContainerSelector& selector);
 
 // Reply decoders. Each checks "ReplyError" first: anything but 1 is a reply
 // error; a missing or non-numeric code, or a success that lacks a key the
@@ -178,9 +214,46 @@ class BerthContainers {
                                   ContainerError* error = nullptr,
                                   uint64_t command = kBerthCommandRecreateDefaultStructure);
 
+    // Command 2: puts `replacement` in the place of `old` (same class and
+    // user), whose contents go to death row; without `old`, moves
+    // `replacement` from its transient place to a permanent one. Both need
+    // their UUIDs: an old container without one is refused here
+    // (InvalidRequest), since the daemon would read it as no old container.
+    bool replace(const std::optional<ContainerSelector>& old, const ContainerSelector& replacement,
+                 ContainerError* error = nullptr);
+
+    // Command 3: moves each container to death row. The daemon silently
+    // skips containers it does not know; an entry without identifier or
+    // UUID is refused here (InvalidRequest) instead, and nothing is sent.
+    bool stageForDelete(const std::vector<ContainerSelector>& containers,
+                        ContainerError* error = nullptr);
+
+    // Command 4: destroys everything on death row. The reply comes when it
+    // is done, so give this object a timeout long enough for that.
+    bool emptyDeathRow(ContainerError* error = nullptr);
+
+    // Command 9: renames the container's directory to a fresh UUID; its
+    // internal UUID and contents stay.
+    bool regenerateDirectoryUUID(const ContainerSelector& selector,
+                                 ContainerError* error = nullptr);
+
+    // Command 10: finds the container by identifier (and transient flag) and
+    // moves it to death row.
+    bool deleteContainer(const ContainerSelector& selector, ContainerError* error = nullptr);
+
+    // Command 11: wipes a class 4 container, only of an identifier the
+    // caller's "sys.kelp.private.Berth.wipeContainer" entitlement lists.
+    bool wipePluginData(const ContainerSelector& selector, ContainerError* error = nullptr);
+
+    // Command 12: wipes a data container (classes 2, 4, 6, 7, 9, 10, 11) of
+    // any identifier.
+    bool wipeData(const ContainerSelector& selector, ContainerError* error = nullptr);
+
   private:
     // Sends `request`; nullopt with a transport error when no reply came.
     std::optional<Value> exchange(const Value& request, ContainerError* error);
+    // Sends `request` and reads the reply's code alone.
+    bool call(const Value& request, ContainerError* error);
 
     BerthConnection& connection_;
     std::chrono::milliseconds timeout_;

@@ -32,6 +32,7 @@ const fs::path& root() {
 const bool kRootInstalled = !root().empty();
 
 const fs::path kBerthctl = BERTHCTL_BINARY_PATH;
+const fs::path kDeathRow = "private/var/root/Library/Caches/sys.kelp.berthd/Dead";
 
 struct Outcome {
     int status = -1;
@@ -181,6 +182,67 @@ TEST_F(BerthctlContainersDaemonTest, RefusalsPrintTheCodeAndFail) {
     EXPECT_EQ(wrongUser.status, 1);
     EXPECT_NE(wrongUser.err.find("BTHErrorInvalidParameter (38)"), std::string::npos)
         << wrongUser.err;
+}
+
+TEST_F(BerthctlContainersDaemonTest, RemovalAndReplace) {
+    const std::string notes = "com.example.notes";
+    auto on = [](const std::string& identifier, std::vector<std::string> args) {
+        args.insert(args.end(), {"--class", "2", "--identifier", identifier});
+        return berthctl(std::move(args));
+    };
+    auto lookUp = [&on](const std::string& identifier) {
+        return printed(on(identifier, {"--json", "lookup"}));
+    };
+    const Value made = printed(on(notes, {"--json", "create"}));
+    const std::string uuid = text(made, "uuid");
+    const fs::path path = text(made, "path");
+    test::writeFile(path / "note", "kept");
+
+    // A new directory name in the same parent; the same container and files.
+    ASSERT_EQ(on(notes, {"regenerate"}).status, 0);
+    const Value moved = lookUp(notes);
+    const fs::path renamed = text(moved, "path");
+    EXPECT_EQ(text(moved, "uuid"), uuid);
+    EXPECT_NE(renamed, path);
+    EXPECT_EQ(renamed.parent_path(), path.parent_path());
+    EXPECT_FALSE(fs::exists(path));
+    EXPECT_EQ(test::readFile(renamed / "note"), "kept");
+
+    // Fresh contents under the same UUID and path.
+    ASSERT_EQ(on(notes, {"wipe"}).status, 0);
+    const Value wiped = lookUp(notes);
+    EXPECT_EQ(text(wiped, "uuid"), uuid);
+    EXPECT_EQ(text(wiped, "path"), renamed.string());
+    EXPECT_TRUE(fs::is_directory(renamed));
+    EXPECT_FALSE(fs::exists(renamed / "note"));
+
+    const std::vector<std::string> replaceNotes = {
+        "replace", "--class", "2", "--old-identifier", notes, "--new-identifier", notes};
+    const Outcome itself = berthctl(replaceNotes);
+    EXPECT_EQ(itself.status, 1);
+    EXPECT_EQ(itself.err.rfind("error: BTHErrorReplaceSameContainer (22): ", 0), 0u) << itself.err;
+    // A transient container of the same identifier, given by its UUID,
+    // takes its place.
+    const std::string fresh = text(printed(on(notes, {"--json", "create", "--transient"})), "uuid");
+    std::vector<std::string> replaceWithFresh = replaceNotes;
+    replaceWithFresh.insert(replaceWithFresh.end(), {"--new-uuid", fresh});
+    const Outcome replaced = berthctl(replaceWithFresh);
+    ASSERT_EQ(replaced.status, 0) << replaced.err;
+    EXPECT_EQ(text(lookUp(notes), "uuid"), fresh);
+    EXPECT_FALSE(fs::exists(renamed));
+
+    // Deleted or staged, a container is gone at once; its directory waits on
+    // death row until that is emptied.
+    const fs::path mail = text(printed(on("com.example.mail", {"--json", "create"})), "path");
+    ASSERT_EQ(on(notes, {"delete"}).status, 0);
+    const Outcome staged = berthctl({"stage-delete", "--container", "2:1:com.example.mail"});
+    ASSERT_EQ(staged.status, 0) << staged.err;
+    for (const std::string& gone : {notes, std::string("com.example.mail")})
+        EXPECT_EQ(on(gone, {"lookup"}).status, 1) << gone;
+    EXPECT_FALSE(fs::exists(mail));
+    const Outcome emptied = berthctl({"empty-death-row"});
+    EXPECT_EQ(emptied.status, 0) << emptied.err;
+    EXPECT_TRUE(fs::is_empty(root() / kDeathRow));
 }
 
 }  // namespace

@@ -1,13 +1,20 @@
 // The container commands on the client side, without a daemon: what the
 // command line accepts, the exact requests sent, and what is made of the
 // replies, including failures and replies that lack what they must carry.
+// The built berthctl also runs against a scripted stand-in for the daemon,
+// which shows the requests a command line turns into.
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 
+#include <cstdlib>
 #include <functional>
+#include <map>
+#include <mutex>
 #include <sstream>
 
 #include "ContainerCommands.h"
 #include "ExitStatus.h"
+#include "RelayTestServer.h"
 #include "TestSupport.h"
 #include "libberth/BerthContainers.h"
 
@@ -30,13 +37,25 @@ Value success(std::initializer_list<std::pair<const char*, Value>> members = {})
 }
 
 // Value equality lets an int64 stand for a uint64; the daemon reads every
-// number with its uint64 getter, so the kind must be exact.
+// number, in arrays too, with its uint64 getter, so the kind must be exact.
 void expectUnsignedNumbers(const Value& request) {
     for (const auto& [key, value] : *request.dictionaryValue()) {
         if (value.isInteger()) {
             EXPECT_EQ(value.kind(), Value::Kind::UInt64) << key;
         }
+        if (value.isArray()) {
+            for (const Value& entry : *value.arrayValue())
+                if (entry.isInteger()) {
+                    EXPECT_EQ(entry.kind(), Value::Kind::UInt64) << key;
+                }
+        }
     }
+}
+
+Value arrayOf(std::initializer_list<Value> entries) {
+    Value result = Value::array();
+    for (const Value& entry : entries) result.push(entry);
+    return result;
 }
 
 TEST(BerthctlContainersTest, ContainerClassesByNumberOrName) {
@@ -70,6 +89,9 @@ TEST(BerthctlContainersTest, RequestsCarryExactKeysAndKinds) {
     selector.transient = true;
     ContainerSelector bare;  // no identifier, no UUID: those keys stay out
     bare.containerClass = 7;
+    ContainerSelector old = selector;
+    old.uuid = kOtherUuid;
+    old.identifier = "com.example.old";
 
     const Value scalar("text");
     const std::pair<Value, Value> cases[] = {
@@ -120,6 +142,47 @@ TEST(BerthctlContainersTest, RequestsCarryExactKeysAndKinds) {
                        {"UserID", uint64_t{501}},
                        {"Identifier", "com.example.notes"},
                        {"UUID", kUuid}})},
+        {makeReplaceRequest(old, selector), dictionaryOf({{"Command", uint64_t{2}},
+                                                          {"OldContainerClass", uint64_t{2}},
+                                                          {"OldContainerUserID", uint64_t{501}},
+                                                          {"OldIdentifier", "com.example.old"},
+                                                          {"OldContainerUUID", kOtherUuid},
+                                                          {"NewContainerClass", uint64_t{2}},
+                                                          {"NewContainerUserID", uint64_t{501}},
+                                                          {"NewIdentifier", "com.example.notes"},
+                                                          {"NewContainerUUID", kUuid}})},
+        // No old container: none of its keys, not even empty ones.
+        {makeReplaceRequest(std::nullopt, bare),
+         dictionaryOf({{"Command", uint64_t{2}},
+                       {"NewContainerClass", uint64_t{7}},
+                       {"NewContainerUserID", uint64_t{1}}})},
+        // Index-aligned, a missing identifier or UUID held by a null.
+        {makeStageForDeleteRequest({selector, bare}),
+         dictionaryOf({{"Command", uint64_t{3}},
+                       {"ContainerClassesArray", arrayOf({uint64_t{2}, uint64_t{7}})},
+                       {"UUIDsArray", arrayOf({kUuid, Value()})},
+                       {"UserIDsArray", arrayOf({uint64_t{501}, uint64_t{1}})},
+                       {"IdentifiersArray", arrayOf({"com.example.notes", Value()})}})},
+        {makeEmptyDeathRowRequest(), dictionaryOf({{"Command", uint64_t{4}}})},
+        {makeRegenerateDirectoryUUIDRequest(selector),
+         dictionaryOf({{"Command", uint64_t{9}},
+                       {"ContainerClass", uint64_t{2}},
+                       {"UserID", uint64_t{501}},
+                       {"Identifier", "com.example.notes"},
+                       {"UUID", kUuid}})},
+        {makeDeleteRequest(selector), dictionaryOf({{"Command", uint64_t{10}},
+                                                    {"ContainerClass", uint64_t{2}},
+                                                    {"UserID", uint64_t{501}},
+                                                    {"Identifier", "com.example.notes"},
+                                                    {"Transient", true}})},
+        // Class 4 is the command's own: the selector's class is not sent.
+        {makeWipePluginDataRequest(selector), dictionaryOf({{"Command", uint64_t{11}},
+                                                            {"UserID", uint64_t{501}},
+                                                            {"Identifier", "com.example.notes"}})},
+        {makeWipeDataRequest(selector), dictionaryOf({{"Command", uint64_t{12}},
+                                                      {"ContainerClass", uint64_t{2}},
+                                                      {"UserID", uint64_t{501}},
+                                                      {"Identifier", "com.example.notes"}})},
     };
     for (const auto& [request, expected] : cases) {
         EXPECT_EQ(request, expected) << request.description();
@@ -293,6 +356,196 @@ TEST(BerthctlContainersTest, CommandLineMistakesNeverReachTheDaemon) {
         EXPECT_EQ(err.str().rfind("error: ", 0), 0u) << err.str();
         EXPECT_NE(err.str().find(c.reason), std::string::npos) << err.str();
     }
+}
+
+// A stand-in for the daemon: records each request and answers look-ups
+// (command 0) of the identifiers it knows; every other command gets the
+// answer set last as its "ReplyError".
+class ScriptedDaemon {
+  public:
+    explicit ScriptedDaemon(std::map<std::string, Uuid> known = {}) : known_(std::move(known)) {}
+
+    const std::filesystem::path& socket() const { return server_.path(); }
+    std::vector<Value> requests() {
+        std::lock_guard lock(mutex_);
+        return requests_;
+    }
+    // Forgets the requests so far and answers `code` from now on.
+    void answerWith(uint64_t code) {
+        std::lock_guard lock(mutex_);
+        requests_.clear();
+        answer_ = code;
+    }
+
+  private:
+    void reply(const Value& request, Value& reply) {
+        std::lock_guard lock(mutex_);
+        requests_.push_back(request);
+        const Value* command = request.find("Command");
+        if (command && command->uint64Value() == uint64_t{kBerthCommandCreateOrLookup}) {
+            const Value* identifier = request.find("Identifier");
+            const auto found = identifier ? known_.find(*identifier->string()) : known_.end();
+            if (found == known_.end()) {
+                reply.set("ReplyError", uint64_t{21});
+                return;
+            }
+            reply.set("ReplyError", uint64_t{1});
+            reply.set("ReplyPath", "/c/" + found->second.string());
+            reply.set("ReplyUUID", found->second);
+            reply.set("ReplyExisted", true);
+            reply.set("ReplyIdentifier", found->first);
+            return;
+        }
+        reply.set("ReplyError", answer_);
+    }
+
+    const std::map<std::string, Uuid> known_;
+    std::mutex mutex_;
+    uint64_t answer_ = 1;
+    std::vector<Value> requests_;
+    test::RelayTestServer server_{
+        [this](const RelayEvent& event, RelayReply& out) { reply(event.message(), out.body()); }};
+};
+
+struct Outcome {
+    int status = -1;
+    std::string out;
+    std::string err;
+};
+
+// Runs the built berthctl with `args` (none holding a quote) and collects
+// what it printed.
+Outcome runBerthctl(const std::vector<std::string>& args) {
+    test::ScratchDir outputs;
+    std::string command = BERTHCTL_BINARY_PATH;
+    for (const std::string& arg : args) command += " '" + arg + "'";
+    command += " >" + (outputs / "out").string() + " 2>" + (outputs / "err").string();
+    const int status = std::system(command.c_str());
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, test::readFile(outputs / "out"),
+            test::readFile(outputs / "err")};
+}
+
+ContainerSelector container(uint64_t containerClass, uint64_t user, const char* identifier,
+                            std::optional<Uuid> uuid = std::nullopt, bool transient = false) {
+    ContainerSelector selector;
+    selector.containerClass = containerClass;
+    selector.userId = user;
+    selector.identifier = identifier;
+    selector.uuid = uuid;
+    selector.transient = transient;
+    return selector;
+}
+
+Value lookUp(const ContainerSelector& selector) {
+    return makeCreateOrLookupRequest(selector, false);
+}
+
+TEST(BerthctlContainersTest, RemovalSubcommandsSendWhatTheirOptionsSay) {
+    ScriptedDaemon daemon({{"com.old", kUuid}, {"com.new", kOtherUuid}});
+    const std::string u = kUuid.string(), o = kOtherUuid.string();
+    const ContainerSelector old = container(2, 1, "com.old", kUuid);
+    const ContainerSelector replacement = container(2, 1, "com.new", kOtherUuid);
+    struct Run {
+        std::vector<std::string> args;
+        std::vector<Value> requests;
+        uint64_t answer;      // the daemon's answer to the last request
+        std::string printed;  // standard output on success; else the start of standard error
+    };
+    const Run runs[] = {
+        // Both containers are looked up, the old one first.
+        {{"replace", "--class", "2", "--old-identifier", "com.old", "--new-identifier", "com.new"},
+         {lookUp(container(2, 1, "com.old")), lookUp(container(2, 1, "com.new")),
+          makeReplaceRequest(old, replacement)},
+         1,
+         "replaced com.old " + u + " with com.new " + o + "\n"},
+        {{"--json", "replace", "--class", "Data/Application", "--user", "501", "--new-identifier",
+          "com.new", "--new-uuid", o},
+         {makeReplaceRequest(std::nullopt, container(2, 501, "com.new", kOtherUuid))},
+         1,
+         R"({"identifier":"com.new","uuid":")" + o + "\"}\n"},
+        // The old side's own class and user.
+        {{"replace", "--class", "2", "--new-identifier", "com.new", "--new-uuid", o,
+          "--old-identifier", "com.old", "--old-uuid", u, "--old-class", "7", "--old-user", "501"},
+         {makeReplaceRequest(container(7, 501, "com.old", kUuid), replacement)},
+         23,
+         "error: BTHErrorReplaceClassMismatch (23): "},
+        // A colon in an identifier is kept when the UUID follows it.
+        {{"stage-delete", "--container", "2:501:com.old", "--container",
+          "Bundle/Application:33:com.a:b:" + o},
+         {lookUp(container(2, 501, "com.old")),
+          makeStageForDeleteRequest(
+              {container(2, 501, "com.old", kUuid), container(1, 33, "com.a:b", kOtherUuid)})},
+         1,
+         "staged com.old " + u + " for deletion\nstaged com.a:b " + o + " for deletion\n"},
+        // One unknown container and nothing is staged.
+        {{"stage-delete", "--container", "2:1:com.old", "--container", "2:1:com.gone"},
+         {lookUp(container(2, 1, "com.old")), lookUp(container(2, 1, "com.gone"))},
+         21,
+         "error: BTHErrorNotFound (21): "},
+        {{"regenerate", "--class", "2", "--identifier", "com.old"},
+         {lookUp(container(2, 1, "com.old")), makeRegenerateDirectoryUUIDRequest(old)},
+         1,
+         "gave a new directory name to com.old\n"},
+        {{"delete", "--class", "2", "--identifier", "com.old", "--transient"},
+         {makeDeleteRequest(container(2, 1, "com.old", {}, true))},
+         1,
+         "deleted com.old\n"},
+        {{"wipe", "--plugin", "--identifier", "com.plugin", "--user", "501"},
+         {makeWipePluginDataRequest(container(0, 501, "com.plugin"))},
+         55,
+         "error: BTHErrorNotEntitled (55): "},
+    };
+    for (const Run& run : runs) {
+        std::vector<std::string> args = run.args;
+        args.insert(args.end(), {"--socket", daemon.socket().string()});
+        SCOPED_TRACE(::testing::PrintToString(args));
+        daemon.answerWith(run.answer);
+        const Outcome outcome = runBerthctl(args);
+        const bool succeeds = run.answer == 1;
+        EXPECT_EQ(outcome.status, succeeds ? ctl::kExitSuccess : ctl::kExitFailure) << outcome.err;
+        EXPECT_EQ(succeeds ? outcome.out : outcome.err.substr(0, run.printed.size()), run.printed);
+        const std::vector<Value> sent = daemon.requests();
+        ASSERT_EQ(sent.size(), run.requests.size());
+        for (size_t i = 0; i < sent.size(); ++i)
+            EXPECT_EQ(sent[i], run.requests[i]) << sent[i].description();
+    }
+
+    // Command-line mistakes: nothing reaches the daemon.
+    const std::pair<std::vector<std::string>, std::string> mistakes[] = {
+        {{"wipe", "--identifier", "com.old"}, "error: give the container's --class, or --plugin"},
+        {{"wipe", "--plugin", "--class", "4", "--identifier", "com.old"}, "--class excludes"},
+        {{"stage-delete"}, "--container is required"},
+        {{"stage-delete", "--container", "2:1"}, "error: \"2:1\" is no container"},
+        {{"stage-delete", "--container", "2:1:com.old:x"}, "error: \"x\" is not a UUID"},
+        {{"replace", "--class", "2", "--old-class", "7"}, "--old-class requires --old-identifier"},
+        {{"replace", "--class", "2", "--new-uuid", u}, "error: --new-uuid needs --new-identifier"},
+    };
+    daemon.answerWith(1);
+    for (auto [args, printed] : mistakes) {
+        args.insert(args.end(), {"--socket", daemon.socket().string()});
+        const Outcome outcome = runBerthctl(args);
+        EXPECT_EQ(outcome.status, ctl::kExitUsage) << printed;
+        EXPECT_EQ(outcome.err.rfind(printed, 0), 0u) << outcome.err;
+    }
+    EXPECT_TRUE(daemon.requests().empty());
+}
+
+TEST(BerthctlContainersTest, RequestsTheDaemonWouldMisreadAreNotSent) {
+    ScriptedDaemon daemon;
+    BerthError error;
+    auto connection = BerthConnection::connect(daemon.socket(), &error);
+    ASSERT_TRUE(connection) << error.message;
+    BerthContainers containers(*connection);
+    // An old container without a UUID would be read as none at all, and a
+    // staged one without one skipped in silence.
+    ContainerError replaceFailure, stageFailure;
+    EXPECT_FALSE(containers.replace(container(2, 1, "com.old"),
+                                    container(2, 1, "com.new", kOtherUuid), &replaceFailure));
+    EXPECT_FALSE(containers.stageForDelete(
+        {container(2, 1, "com.old", kUuid), container(2, 1, "com.new")}, &stageFailure));
+    for (const ContainerError& failure : {replaceFailure, stageFailure})
+        EXPECT_EQ(failure.transport.code, BerthError::Code::InvalidRequest) << failure.describe();
+    EXPECT_TRUE(daemon.requests().empty());
 }
 
 }  // namespace
