@@ -222,7 +222,11 @@ class CreateOrLookup {
             BTHSetError(error,
                         BTHMakeError(BTHErrorRemoveTransientFailed, deathRowError,
                                      "Failed to remove transient container at %@", found->url()));
+            return nullptr;
         }
+        // The retired container leaves the cache too: a look-up that does
+        // not create must not leave behind an entry whose directory is gone.
+        cache.removeContainerForUser(userId_, containerClass_, identifier_, true, nullptr);
         return nullptr;
     }
 

@@ -189,6 +189,11 @@ TEST_F(DaemonContainersTest, TransientContainersAreNeverReused) {
     EXPECT_FALSE(fs::exists(text(first, "ReplyPath")));
     EXPECT_TRUE(fs::is_directory(text(second, "ReplyPath")));
     EXPECT_TRUE(deathRowEmpties());
+    // A look-up that does not create retires the transient container too,
+    // and leaves nothing behind that later requests would trip over.
+    EXPECT_EQ(code(call(create(2, 501, "sys.kelp.transient", true, false))), 21u);
+    EXPECT_EQ(code(call(create(2, 501, "sys.kelp.transient", true, false))), 21u);
+    EXPECT_EQ(code(call(create(2, 501, "sys.kelp.transient", true))), 1u);
     // Transient containers live apart from permanent ones.
     EXPECT_NE(fs::path(text(second, "ReplyPath")).parent_path(), root() / kDataClassDirectory);
 }
