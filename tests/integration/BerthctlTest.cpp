@@ -1,77 +1,28 @@
 // berthctl against a real daemon on a scratch device root, run as a child
 // process the way an administrator or a script runs it: what it prints, the
 // exit status, and what it changes on the device root.
-#include <fcntl.h>
-#include <grp.h>
-#include <gtest/gtest.h>
 #include <sys/socket.h>
-#include <sys/un.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <cstring>
 #include <fstream>
-#include <optional>
-#include <string>
-#include <vector>
 
-#include "DaemonProcess.h"
-#include "ScratchDeviceRoot.h"
-#include "TestSupport.h"
+#include "DaemonSupport.h"
 #include "core/ValueJson.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/LockStateNotification.h"
-#include "platform/NamedSemaphore.h"
-#include "platform/UniqueFd.h"
+#include "platform/ServiceCheckIn.h"
 
 namespace berth {
 namespace {
 
+using test::Outcome;
+using test::run;
+
 const std::filesystem::path& root() {
-    static const std::filesystem::path& path = test::installScratchDeviceRoot();
-    return path;
+    return test::deviceRoot();
 }
-const bool kRootInstalled = !root().empty();
 
 const std::filesystem::path kBerthctl = BERTHCTL_BINARY_PATH;
 constexpr uid_t kNobody = 65534;
-
-struct Outcome {
-    int status = -1;
-    std::string out;
-    std::string err;
-};
-
-// Runs `program` with `args` (BERTH_ROOT inherited), as `user` when given,
-// and collects its output and exit status.
-Outcome run(const std::filesystem::path& program, const std::vector<std::string>& args,
-            std::optional<uid_t> user = std::nullopt) {
-    test::ScratchDir outputs;
-    UniqueFd out(::open((outputs / "out").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
-    UniqueFd err(::open((outputs / "err").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
-    std::vector<std::string> strings{program.string()};
-    strings.insert(strings.end(), args.begin(), args.end());
-    std::vector<char*> argv;
-    for (auto& s : strings) argv.push_back(s.data());
-    argv.push_back(nullptr);
-
-    Outcome result;
-    const pid_t pid = ::fork();
-    if (pid == 0) {
-        ::dup2(out.get(), STDOUT_FILENO);
-        ::dup2(err.get(), STDERR_FILENO);
-        if (user && (::setgroups(0, nullptr) != 0 || ::setgid(*user) != 0 || ::setuid(*user) != 0))
-            _exit(126);
-        ::execv(argv[0], argv.data());
-        _exit(127);
-    }
-    int status = 0;
-    if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return result;
-    result.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    result.out = test::readFile(outputs / "out");
-    result.err = test::readFile(outputs / "err");
-    return result;
-}
 
 Outcome berthctl(const std::vector<std::string>& args, std::optional<uid_t> user = std::nullopt) {
     return run(kBerthctl, args, user);
@@ -82,8 +33,7 @@ uint64_t printedReplyError(const Outcome& sent) {
     std::string why;
     std::optional<Value> reply = valueFromJson(sent.out, &why);
     EXPECT_TRUE(reply) << why << "\n" << sent.out << sent.err;
-    const Value* code = reply ? reply->find("ReplyError") : nullptr;
-    return code ? code->uint64Value().value_or(0) : 0;
+    return reply ? test::code(*reply) : 0;
 }
 
 std::string trimmed(std::string text) {
@@ -91,27 +41,10 @@ std::string trimmed(std::string text) {
     return text;
 }
 
-class BerthctlTest : public ::testing::Test {
-  protected:
-    void SetUp() override {
-        BERTH_REQUIRE_ROOT();
-        ASSERT_TRUE(kRootInstalled);
-    }
-
-    // The scratch root's first-boot marker outlives the test otherwise.
-    void TearDown() override { NamedSemaphore::remove("berthd.fb_check"); }
-
-    // Starts the daemon on the scratch root and waits until it serves.
-    void startDaemon() {
-        daemon_.emplace(root());
-        ASSERT_TRUE(daemon_->waitUntilServing()) << daemon_->standardError();
-    }
-
-    std::optional<test::DaemonProcess> daemon_;
-};
+class BerthctlTest : public test::DaemonFixture {};
 
 TEST_F(BerthctlTest, SendPrintsTheReplyAndExitsByItsCode) {
-    ASSERT_NO_FATAL_FAILURE(startDaemon());
+    ASSERT_NO_FATAL_FAILURE(start());
 
     const Outcome invalid = berthctl({"send", R"({"Command": 30})"});
     EXPECT_EQ(invalid.status, 1) << invalid.err;
@@ -131,7 +64,7 @@ TEST_F(BerthctlTest, SendPrintsTheReplyAndExitsByItsCode) {
 }
 
 TEST_F(BerthctlTest, EntitlementsFollowTheSignatureOfTheRunningProgram) {
-    ASSERT_NO_FATAL_FAILURE(startDaemon());
+    ASSERT_NO_FATAL_FAILURE(start());
     // An identical copy elsewhere is another program as far as the registry
     // is concerned: it stays unsigned.
     test::ScratchDir dir;
@@ -167,14 +100,13 @@ TEST_F(BerthctlTest, EntitlementsFollowTheSignatureOfTheRunningProgram) {
 // The entitlement rules through the real daemon: clients registered under
 // different identities, each a copy of berthctl signed with its own set.
 TEST_F(BerthctlTest, EntitlementMatrixThroughTheDaemon) {
-    ASSERT_NO_FATAL_FAILURE(startDaemon());
+    ASSERT_NO_FATAL_FAILURE(start());
     test::ScratchDir dir;
     ::chmod(dir.path().c_str(), 0755);
-    Value wipeList = Value::array();
-    wipeList.push("sys.kelp.plugin");
+    const Value wipeList(Value::Array{Value("sys.kelp.plugin")});
     struct Client {
         const char* name;
-        std::vector<std::pair<const char*, Value>> entitlements;
+        Value entitlements;
         // Expected reply errors of commands 0, 1, 11 and 24, sent without
         // keys: 55 when refused; otherwise what the handler answers (38 for
         // a request naming no valid user, 18 for a wipe naming no identifier,
@@ -182,22 +114,26 @@ TEST_F(BerthctlTest, EntitlementMatrixThroughTheDaemon) {
         uint64_t expected[4];
     };
     const Client clients[] = {
-        {"none", {}, {38, 55, 55, 55}},
-        {"allowed", {{"sys.kelp.private.Berth.allowed", true}}, {38, 38, 18, 49}},
-        {"lookup", {{"sys.kelp.private.Berth.otherIdLookup", true}}, {38, 55, 55, 55}},
-        {"wiper", {{"sys.kelp.private.Berth.wipeContainer", wipeList}}, {38, 55, 18, 55}},
-        {"wipeflag", {{"sys.kelp.private.Berth.wipeContainer", true}}, {38, 55, 55, 55}},
-        {"migrator", {{"sys.kelp.private.Berth.dataMigration", true}}, {38, 55, 55, 49}},
+        {"none", Value::dictionary(), {38, 55, 55, 55}},
+        {"allowed", test::dict({{"sys.kelp.private.Berth.allowed", true}}), {38, 38, 18, 49}},
+        {"lookup", test::dict({{"sys.kelp.private.Berth.otherIdLookup", true}}), {38, 55, 55, 55}},
+        {"wiper",
+         test::dict({{"sys.kelp.private.Berth.wipeContainer", wipeList}}),
+         {38, 55, 18, 55}},
+        {"wipeflag",
+         test::dict({{"sys.kelp.private.Berth.wipeContainer", true}}),
+         {38, 55, 55, 55}},
+        {"migrator",
+         test::dict({{"sys.kelp.private.Berth.dataMigration", true}}),
+         {38, 55, 55, 49}},
     };
     const uint64_t commands[] = {0, 1, 11, 24};
     for (const Client& client : clients) {
         const auto program = dir / client.name;
         std::filesystem::copy_file(kBerthctl, program);
-        Value entitlements = Value::dictionary();
-        for (const auto& [key, value] : client.entitlements) entitlements.set(key, value);
         std::string why;
         ASSERT_EQ(CodeSigningRegistry().sign(program, std::string("sys.kelp.") + client.name,
-                                             entitlements, &why),
+                                             client.entitlements, &why),
                   0)
             << why;
         for (size_t i = 0; i < 4; ++i) {
@@ -222,15 +158,11 @@ TEST_F(BerthctlTest, DaemonThatCannotBeAskedIsExitStatusTwo) {
     EXPECT_NE(absent.err.find("not running"), std::string::npos) << absent.err;
 
     // A socket that takes the request but never answers.
-    const auto path = dir / "silent";
-    UniqueFd listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-    ASSERT_EQ(::listen(listener.get(), 4), 0);
-    const Outcome silent =
-        berthctl({"send", "--socket", path.string(), "--timeout", "0.3", R"({"Command": 1})"});
+    auto silentSocket =
+        ServiceCheckIn::claim("silent", SOCK_STREAM, 0666, nullptr, nullptr, dir.path());
+    ASSERT_TRUE(silentSocket);
+    const Outcome silent = berthctl({"send", "--socket", silentSocket->path().string(), "--timeout",
+                                     "0.3", R"({"Command": 1})"});
     EXPECT_EQ(silent.status, 2);
     EXPECT_TRUE(silent.out.empty());
     EXPECT_FALSE(silent.err.empty());

@@ -3,38 +3,22 @@
 // the next start must put every container where the replace journal says and
 // lose no data. Also the replace command's refusals, a replace that goes
 // through, and one whose second move fails.
-#include <gtest/gtest.h>
 #include <signal.h>
 
-#include <algorithm>
-#include <chrono>
-#include <map>
-#include <optional>
-#include <string>
-#include <thread>
-#include <vector>
-
-#include "BTHDaemon.h"
 #include "BTHMetadata.h"
 #include "BTHPropertyListFile.h"
-#include "DaemonProcess.h"
-#include "ScratchDeviceRoot.h"
-#include "TestSupport.h"
-#include "client/libberth/BerthConnection.h"
+#include "DaemonSupport.h"
 #include "core/ErrorCodes.h"
-#include "platform/CodeSigningRegistry.h"
-#include "platform/NamedSemaphore.h"
 
 namespace berth {
 namespace {
 
 namespace fs = std::filesystem;
+using namespace test;
 
 const fs::path& root() {
-    static const fs::path& path = test::installScratchDeviceRoot();
-    return path;
+    return deviceRoot();
 }
-const bool kRootInstalled = !root().empty();
 
 constexpr const char* kSelf = "sys.kelp.recovery.tester";
 constexpr const char* kFaults = "BERTH_TEST_FAULTS";
@@ -42,10 +26,6 @@ constexpr uint64_t kDataClass = 2;
 constexpr uint64_t kPluginDataClass = 4;
 constexpr uint64_t kMobile = 501;
 constexpr uint64_t kOther = 502;
-const fs::path kDataClassDirectory = "private/var/mobile/Containers/Data/Application";
-const fs::path kReplaceDirectory = "private/var/root/Library/Berth/Replace";
-const fs::path kStagingDirectory = "private/var/root/Library/Caches/sys.kelp.berthd/Staging";
-const fs::path kDeathRowDirectory = "private/var/root/Library/Caches/sys.kelp.berthd/Dead";
 
 // A container as the reply that made it names it, with the marker file the
 // test put into it.
@@ -61,64 +41,27 @@ struct Container {
     fs::path markerAt(const fs::path& directory) const { return directory / "Documents" / marker; }
 };
 
-Value create(uint64_t containerClass, uint64_t user, const std::string& identifier,
-             bool transient = false, bool createIfNecessary = true) {
-    Value m = Value::dictionary();
-    m.set("Command", uint64_t{0});
-    m.set("ContainerClass", containerClass);
-    m.set("UserID", user);
-    m.set("Identifier", identifier);
-    m.set("CreateIfNecessary", createIfNecessary);
-    m.set("Transient", transient);
-    return m;
-}
-
 // Command 7 about `container`, found by its UUID.
 Value metadataOf(const Container& container) {
-    Value m = Value::dictionary();
-    m.set("Command", uint64_t{7});
-    m.set("ContainerClass", container.containerClass);
-    m.set("UserID", container.user);
-    m.set("Identifier", container.identifier);
+    Value m = request(7, container.containerClass, container.user, container.identifier);
     m.set("UUID", container.uuid);
     return m;
 }
 
 // Command 2: `replacement` takes the place of `old` (none: of nothing).
 Value replace(const Container* old, const Container& replacement) {
-    Value m = Value::dictionary();
-    m.set("Command", uint64_t{2});
+    Value m = dict({{"Command", uint64_t{2}},
+                    {"NewContainerUUID", replacement.uuid},
+                    {"NewContainerClass", replacement.containerClass},
+                    {"NewContainerUserID", replacement.user},
+                    {"NewIdentifier", replacement.identifier}});
     if (old) {
         m.set("OldContainerUUID", old->uuid);
         m.set("OldContainerClass", old->containerClass);
         m.set("OldContainerUserID", old->user);
         m.set("OldIdentifier", old->identifier);
     }
-    m.set("NewContainerUUID", replacement.uuid);
-    m.set("NewContainerClass", replacement.containerClass);
-    m.set("NewContainerUserID", replacement.user);
-    m.set("NewIdentifier", replacement.identifier);
     return m;
-}
-
-uint64_t code(const Value& reply) {
-    const Value* value = reply.find("ReplyError");
-    return value ? value->uint64Value().value_or(0) : 0;
-}
-
-std::string text(const Value& value, const char* key) {
-    const Value* found = value.find(key);
-    return found && found->string() ? *found->string() : std::string();
-}
-
-// Names in a directory, sorted; none when it does not exist.
-std::vector<std::string> listing(const fs::path& directory) {
-    std::vector<std::string> names;
-    std::error_code ignored;
-    for (const auto& entry : fs::directory_iterator(directory, ignored))
-        names.push_back(entry.path().filename().string());
-    std::sort(names.begin(), names.end());
-    return names;
 }
 
 // Every file named `name` anywhere under the device root: where a marker's
@@ -135,61 +78,22 @@ std::vector<fs::path> filesNamed(const std::string& name) {
     return found;
 }
 
-// Waits (bounded) for the background emptying of death row.
-bool deathRowEmpties() {
-    for (int i = 0; i < 250; ++i) {
-        if (listing(root() / kDeathRowDirectory).empty()) return true;
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
-    return false;
-}
-
 // Nothing of an unfinished replace or creation is left.
 void expectNoReplaceInProgress() {
     EXPECT_EQ(listing(root() / kReplaceDirectory), std::vector<std::string>{});
     EXPECT_EQ(listing(root() / kStagingDirectory), std::vector<std::string>{});
 }
 
-class DaemonRecoveryTest : public ::testing::Test {
+// The first start of each test does the once-per-boot work; the restarts
+// after a crash are restarts within the same boot, which keep transient
+// containers.
+class DaemonRecoveryTest : public DaemonFixture {
   protected:
     void SetUp() override {
-        BERTH_REQUIRE_ROOT();
-        ASSERT_TRUE(kRootInstalled);
-        // The first start of each test does the once-per-boot work; the
-        // restarts after a crash are restarts within the same boot, which
-        // keep transient containers.
-        NamedSemaphore::remove(kBTHFirstBootSemaphoreName);
+        DaemonFixture::SetUp();
+        if (IsSkipped() || HasFatalFailure()) return;
         tag_ = Uuid::random().string();
-        Value entitlements = Value::dictionary();
-        entitlements.set("sys.kelp.private.Berth.allowed", true);
-        std::string why;
-        ASSERT_EQ(CodeSigningRegistry().sign(fs::read_symlink("/proc/self/exe"), kSelf,
-                                             entitlements, &why),
-                  0)
-            << why;
-    }
-
-    void TearDown() override {
-        connection_.reset();
-        daemon_.reset();
-        NamedSemaphore::remove(kBTHFirstBootSemaphoreName);
-    }
-
-    void start(std::map<std::string, std::string> environment = {}) {
-        connection_.reset();
-        daemon_.reset();
-        daemon_.emplace(root(), std::move(environment));
-        ASSERT_TRUE(daemon_->waitUntilServing()) << daemon_->standardError();
-        connection_ = BerthConnection::connect(daemon_->requestSocket());
-        ASSERT_TRUE(connection_);
-    }
-
-    Value call(const Value& message) {
-        BerthError error;
-        std::optional<Value> reply =
-            connection_->request(message, std::chrono::seconds(20), &error);
-        EXPECT_TRUE(reply) << error.message;
-        return reply ? *reply : Value::dictionary();
+        signSelf(kSelf, dict({{"sys.kelp.private.Berth.allowed", true}}));
     }
 
     // Sends `message` to a daemon armed to die on the way: no reply comes,
@@ -222,7 +126,7 @@ class DaemonRecoveryTest : public ::testing::Test {
                           .path = text(reply, "ReplyPath"),
                           .marker = named(marker)};
         ASSERT_FALSE(made->path.empty());
-        test::writeFile(made->markerAt(made->path), made->marker);
+        writeFile(made->markerAt(made->path), made->marker);
     }
 
     // The permanent container of `identifier` (user 501, class 2), looked up
@@ -248,12 +152,10 @@ class DaemonRecoveryTest : public ::testing::Test {
             << container.identifier << " " << found.description();
         EXPECT_EQ(text(found, "ReplyPath"), path.string());
         EXPECT_EQ(*found.find("ReplyTransient"), Value(transient));
-        EXPECT_EQ(test::readFile(container.markerAt(path)), container.marker);
+        EXPECT_EQ(readFile(container.markerAt(path)), container.marker);
     }
 
     std::string tag_;
-    std::optional<test::DaemonProcess> daemon_;
-    std::unique_ptr<BerthConnection> connection_;
 };
 
 // A crash point of replace and the on-disk state it leaves.
@@ -418,9 +320,7 @@ TEST_F(DaemonRecoveryTest, ReplaceRefusalsTouchNothingAndASuccessRetiresTheOld) 
     // emptied, and nowhere afterwards.
     for (const fs::path& marker : filesNamed(old.marker))
         EXPECT_TRUE(marker.string().starts_with((root() / kDeathRowDirectory).string())) << marker;
-    Value empty = Value::dictionary();
-    empty.set("Command", uint64_t{4});
-    EXPECT_EQ(code(call(empty)), uint64_t{BTHErrorSuccess});
+    EXPECT_EQ(code(call(dict({{"Command", uint64_t{4}}}))), uint64_t{BTHErrorSuccess});
     EXPECT_EQ(filesNamed(old.marker), std::vector<fs::path>{});
 
     // Without an old container, a transient container becomes a permanent
@@ -438,7 +338,7 @@ TEST_F(DaemonRecoveryTest, ReplaceRefusalsTouchNothingAndASuccessRetiresTheOld) 
 // Clears the immutable flag it was given when it goes.
 struct ImmutableFlag {
     fs::path path;
-    ~ImmutableFlag() { test::setImmutable(path, false); }
+    ~ImmutableFlag() { setImmutable(path, false); }
 };
 
 TEST_F(DaemonRecoveryTest, AFailedSecondMovePutsTheOldContainerBack) {
@@ -449,7 +349,7 @@ TEST_F(DaemonRecoveryTest, AFailedSecondMovePutsTheOldContainerBack) {
     ASSERT_NO_FATAL_FAILURE(make(kDataClass, kMobile, identifier, true, "stuck-new", &replacement));
     // An immutable directory cannot be renamed: the replace moves the old
     // container aside, then fails to move the new one in.
-    if (!test::setImmutable(replacement.path, true))
+    if (!setImmutable(replacement.path, true))
         GTEST_SKIP() << "no immutable flag on this file system";
     {
         const ImmutableFlag flag{replacement.path};

@@ -1,20 +1,15 @@
 // Start-up of the real daemon on a scratch device root: the once-per-boot
 // marker, refusal to start beside another instance, the upcall socket's
 // error replies, and the request socket's intake.
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
 #include <cstring>
-#include <thread>
 
 #include "BTHDaemon.h"
 #include "BTHUpcallServer.h"
-#include "DaemonProcess.h"
-#include "ScratchDeviceRoot.h"
-#include "TestSupport.h"
-#include "client/libberth/BerthConnection.h"
+#include "DaemonSupport.h"
 #include "core/ErrorCodes.h"
 #include "platform/NamedSemaphore.h"
 #include "platform/ServiceCheckIn.h"
@@ -22,11 +17,11 @@
 namespace berth {
 namespace {
 
+using test::DaemonProcess;
+
 const std::filesystem::path& root() {
-    static const std::filesystem::path& path = test::installScratchDeviceRoot();
-    return path;
+    return test::deviceRoot();
 }
-const bool kRootInstalled = !root().empty();
 
 std::string logText() {
     return test::readFile(root() / "private/var/root/Library/Logs/Berth/berthd.log");
@@ -38,45 +33,31 @@ size_t occurrences(const std::string& text, const std::string& what) {
     return n;
 }
 
-class DaemonStartupTest : public ::testing::Test {
-  protected:
-    void SetUp() override {
-        BERTH_REQUIRE_ROOT();
-        ASSERT_TRUE(kRootInstalled);
-        NamedSemaphore::remove(kBTHFirstBootSemaphoreName);
-    }
-    void TearDown() override { NamedSemaphore::remove(kBTHFirstBootSemaphoreName); }
-};
+// The daemon is started by each test itself.
+class DaemonStartupTest : public test::DaemonFixture {};
 
-uint64_t replyError(const std::optional<Value>& reply) {
-    if (!reply) return 0;
-    const Value* code = reply->find("ReplyError");
-    return code ? code->uint64Value().value_or(0) : 0;
-}
-
-std::optional<Value> request(BerthConnection& connection, Value message) {
+// The "ReplyError" of `message` sent over `connection`.
+uint64_t replyError(BerthConnection& connection, Value message) {
     BerthError error;
     auto reply = connection.request(message, std::chrono::seconds(10), &error);
     EXPECT_FALSE(error) << error.message;
-    return reply;
+    return reply ? test::code(*reply) : 0;
 }
 
 Value command(uint64_t n) {
-    Value m = Value::dictionary();
-    m.set("Command", n);
-    return m;
+    return test::dict({{"Command", n}});
 }
 
 TEST_F(DaemonStartupTest, FirstBootWorkRunsOncePerBoot) {
     const std::string before = logText();
     {
-        test::DaemonProcess daemon(root());
+        DaemonProcess daemon(root());
         ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
         EXPECT_TRUE(NamedSemaphore::exists(kBTHFirstBootSemaphoreName));
         daemon.stop(SIGTERM);
     }
     {
-        test::DaemonProcess daemon(root());
+        DaemonProcess daemon(root());
         ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
         daemon.stop(SIGKILL);
     }
@@ -90,7 +71,7 @@ TEST_F(DaemonStartupTest, UpcallCheckInFailureExitsWith255AndLeavesNoMarker) {
     int error = 0;
     auto holder = ServiceCheckIn::claim(kBTHUpcallServiceName, SOCK_SEQPACKET, 0600, &error);
     ASSERT_TRUE(holder) << strerror(error);
-    test::DaemonProcess daemon(root());
+    DaemonProcess daemon(root());
     EXPECT_EQ(daemon.waitForExit(), 255);
     EXPECT_FALSE(NamedSemaphore::exists(kBTHFirstBootSemaphoreName));
     EXPECT_NE(logText().find("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting."),
@@ -98,42 +79,37 @@ TEST_F(DaemonStartupTest, UpcallCheckInFailureExitsWith255AndLeavesNoMarker) {
 }
 
 TEST_F(DaemonStartupTest, SecondInstanceExitsAndTheFirstKeepsServing) {
-    test::DaemonProcess first(root());
+    DaemonProcess first(root());
     ASSERT_TRUE(first.waitUntilServing()) << first.standardError();
-    test::DaemonProcess second(root());
+    DaemonProcess second(root());
     EXPECT_EQ(second.waitForExit(), 255);
     auto connection = BerthConnection::connect(first.requestSocket());
     ASSERT_TRUE(connection);
-    EXPECT_EQ(replyError(request(*connection, command(30))), uint64_t{BTHErrorInvalidCommand});
+    EXPECT_EQ(replyError(*connection, command(30)), uint64_t{BTHErrorInvalidCommand});
     first.stop(SIGKILL);
 
     // A socket left by a killed instance is replaced by the next one.
-    test::DaemonProcess third(root());
+    DaemonProcess third(root());
     ASSERT_TRUE(third.waitUntilServing()) << third.standardError();
 }
 
 TEST_F(DaemonStartupTest, RequestsFromAnUnsignedCallerReachOnlyOpenCommands) {
-    test::DaemonProcess daemon(root());
-    ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
-    auto connection = BerthConnection::connect(daemon.requestSocket());
-    ASSERT_TRUE(connection);
+    ASSERT_NO_FATAL_FAILURE(start());
     // This test program has no signature: no identifier, no entitlements.
-    EXPECT_EQ(replyError(request(*connection, command(1))), uint64_t{BTHErrorNotEntitled});
-    EXPECT_EQ(replyError(request(*connection, command(24))), uint64_t{BTHErrorNotEntitled});
-    EXPECT_EQ(replyError(request(*connection, command(30))), uint64_t{BTHErrorInvalidCommand});
-    EXPECT_EQ(replyError(request(*connection, command(uint64_t{1} << 33))),
+    EXPECT_EQ(replyError(*connection_, command(1)), uint64_t{BTHErrorNotEntitled});
+    EXPECT_EQ(replyError(*connection_, command(24)), uint64_t{BTHErrorNotEntitled});
+    EXPECT_EQ(replyError(*connection_, command(30)), uint64_t{BTHErrorInvalidCommand});
+    EXPECT_EQ(replyError(*connection_, command(uint64_t{1} << 33)),
               uint64_t{BTHErrorInvalidCommand});
     // Command 0 is open to every caller: its handler answers (here refusing
     // the missing user).
-    EXPECT_EQ(replyError(request(*connection, Value::dictionary())),
-              uint64_t{BTHErrorInvalidParameter});
+    EXPECT_EQ(replyError(*connection_, Value::dictionary()), uint64_t{BTHErrorInvalidParameter});
     EXPECT_NE(logText().find("missing required entitlement: sys.kelp.private.Berth.allowed"),
               std::string::npos);
 }
 
 TEST_F(DaemonStartupTest, UpcallRequestsGetErrorReplies) {
-    test::DaemonProcess daemon(root());
-    ASSERT_TRUE(daemon.waitUntilServing()) << daemon.standardError();
+    ASSERT_NO_FATAL_FAILURE(start());
     int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
     ASSERT_GE(fd, 0);
     sockaddr_un address{};

@@ -1,9 +1,11 @@
 #include "TestSupport.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <linux/fs.h>
 #include <spdlog/sinks/base_sink.h>
 #include <sys/ioctl.h>
+#include <sys/wait.h>
 
 #include <cstdlib>
 #include <fstream>
@@ -125,6 +127,94 @@ bool setImmutable(const std::filesystem::path& path, bool on) {
     if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) return false;
     flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
     return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+struct stat lstatOf(const std::filesystem::path& path) {
+    struct stat st {};
+    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
+    return st;
+}
+
+std::set<std::string> namesIn(const std::filesystem::path& directory) {
+    std::set<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(directory))
+        names.insert(entry.path().filename());
+    return names;
+}
+
+void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& description,
+                      const std::string& function) {
+    ASSERT_TRUE(error) << "no error, expected errno " << code;
+    EXPECT_TRUE(error->isPOSIXError(code)) << error->description();
+    if (!description.empty()) {
+        EXPECT_EQ(error->localizedDescription(), description);
+    }
+    if (!function.empty()) {
+        EXPECT_EQ(error->functionName(), function);
+    }
+}
+
+bool eventually(const std::function<bool()>& condition, std::chrono::milliseconds limit) {
+    const auto end = std::chrono::steady_clock::now() + limit;
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() > end) return false;
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return true;
+}
+
+int inChild(const std::function<int()>& body, std::optional<uid_t> user) {
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+        if (user && (::setgroups(0, nullptr) != 0 || ::setresgid(*user, *user, *user) != 0 ||
+                     ::setresuid(*user, *user, *user) != 0))
+            ::_exit(100);
+        ::_exit(body());
+    }
+    int status = 0;
+    if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+void Event::set() {
+    std::lock_guard lock(mutex_);
+    set_ = true;
+    changed_.notify_all();
+}
+
+bool Event::isSet() const {
+    std::lock_guard lock(mutex_);
+    return set_;
+}
+
+bool Event::wait(std::chrono::milliseconds limit) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, limit, [this] { return set_; });
+}
+
+LinkSwapper::LinkSwapper(const std::filesystem::path& tree, const std::filesystem::path& outside)
+    : thread_([this, victim = tree / "victim", aside = tree / "victim.real",
+               innerAside = tree / "inner.real", target = outside.string()] {
+          const std::filesystem::path inner = aside / "inner";
+          const auto pause = std::chrono::microseconds(100);
+          while (!stop_.load()) {
+              if (::rename(victim.c_str(), aside.c_str()) == 0) {
+                  ::symlink(target.c_str(), victim.c_str());
+                  ::rename(inner.c_str(), innerAside.c_str());
+                  ::symlink((target + "/inner").c_str(), inner.c_str());
+                  std::this_thread::sleep_for(pause);
+                  ::unlink(inner.c_str());
+                  ::rename(innerAside.c_str(), inner.c_str());
+                  ::unlink(victim.c_str());
+                  ::rename(aside.c_str(), victim.c_str());
+              }
+              std::this_thread::sleep_for(pause);
+          }
+      }) {}
+
+LinkSwapper::~LinkSwapper() {
+    stop_ = true;
+    thread_.join();
 }
 
 }  // namespace berth::test

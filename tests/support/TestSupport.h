@@ -1,14 +1,26 @@
 // Shared helpers of the test programs: scratch directories, a view of what
-// the daemon logged, and the root check of tests that need privileges.
+// the daemon logged, waiting, child processes, error checks, and the root
+// check of tests that need privileges.
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <filesystem>
+#include <functional>
 #include <mutex>
+#include <optional>
+#include <set>
 #include <string>
+#include <thread>
 #include <vector>
+
+#include "BTHError.h"
+#include "core/Value.h"
 
 namespace berth::test {
 
@@ -61,7 +73,66 @@ std::string readFile(const std::filesystem::path& path);
 // Sets or clears the immutable flag of `path` (not following a link).
 bool setImmutable(const std::filesystem::path& path, bool on);
 
+// lstat of `path`, failing the test when there is none.
+struct stat lstatOf(const std::filesystem::path& path);
+// The names in a directory.
+std::set<std::string> namesIn(const std::filesystem::path& directory);
+
+inline Value dict(Value::Dictionary members) {
+    return Value(std::move(members));
+}
+
+// An error of `code` in the POSIX domain, with this description and function
+// when they are given.
+void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& description = {},
+                      const std::string& function = {});
+
+// Waits until `condition` holds; false when `limit` passed first. The limit
+// is there only so a broken program fails instead of hanging.
+bool eventually(const std::function<bool()>& condition,
+                std::chrono::milliseconds limit = std::chrono::seconds(60));
+
+// Runs `body` in a forked child (as `user`, groups and all, when given) and
+// gives its exit status, or 128 + the signal that ended it.
+int inChild(const std::function<int()>& body, std::optional<uid_t> user = std::nullopt);
+
+// A one-shot signal between threads.
+class Event {
+  public:
+    void set();
+    bool isSet() const;
+    // False when `limit` passed first.
+    bool wait(std::chrono::milliseconds limit = std::chrono::seconds(60));
+
+  private:
+    mutable std::mutex mutex_;
+    std::condition_variable changed_;
+    bool set_ = false;
+};
+
+// The app owning `tree` swapping its directory "victim" (and victim/inner)
+// for links into `outside` (and outside/inner), over and over, while it lives.
+class LinkSwapper {
+  public:
+    LinkSwapper(const std::filesystem::path& tree, const std::filesystem::path& outside);
+    ~LinkSwapper();
+
+  private:
+    std::atomic<bool> stop_{false};
+    std::thread thread_;
+};
+
 }  // namespace berth::test
+
+// A death test whose statement would hang if the fault were not detected:
+// the alarm ends the child then, and the test fails instead of hanging.
+#define EXPECT_DEATH_BOUNDED(statement, regex) \
+    EXPECT_DEATH(                              \
+        {                                      \
+            ::alarm(30);                       \
+            statement;                         \
+        },                                     \
+        regex)
 
 // Skips the current test, with the reason, when not running as root.
 #define BERTH_REQUIRE_ROOT()                                               \
