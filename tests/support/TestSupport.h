@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "BTHError.h"
+#include "BTHFileManager.h"
 #include "core/Value.h"
 
 namespace berth::test {
@@ -77,6 +78,10 @@ bool setImmutable(const std::filesystem::path& path, bool on);
 struct stat lstatOf(const std::filesystem::path& path);
 // The names in a directory.
 std::set<std::string> namesIn(const std::filesystem::path& directory);
+
+inline BTHFileManager& manager() {
+    return BTHFileManager::defaultManager();
+}
 
 inline Value dict(Value::Dictionary members) {
     return Value(std::move(members));

@@ -6,20 +6,11 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <grp.h>
-#include <gtest/gtest.h>
 #include <sys/acl.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <filesystem>
-#include <functional>
 #include <sstream>
-#include <string>
-#include <vector>
 
 #include "BTHFileManager+Internal.h"
-#include "BTHFileManager.h"
 #include "BTHMetadata.h"
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
@@ -29,6 +20,7 @@ namespace {
 
 namespace stdfs = std::filesystem;
 using filemanager::UniqueAcl;
+using namespace test;
 
 [[maybe_unused]] const auto& kRoot = test::installScratchDeviceRoot();
 
@@ -37,10 +29,6 @@ constexpr uid_t kNobody = 65534;
 constexpr const char* kTopAccess = "user::rwx,group::r-x,group:510:-wx,mask::rwx,other::r-x";
 constexpr const char* kItemAccess = "user::---,group::---,group:510:rwx,mask::rwx,other::---";
 constexpr const char* kInherited = "user::rwx,group::---,group:510:rwx,mask::rwx,other::---";
-
-BTHFileManager& manager() {
-    return BTHFileManager::defaultManager();
-}
 
 // An item's ACL of `type` in libacl's text.
 std::string aclText(const stdfs::path& path, acl_type_t type) {
@@ -52,17 +40,11 @@ std::string aclText(const stdfs::path& path, acl_type_t type) {
     return out;
 }
 
-struct stat lstatOf(const stdfs::path& path) {
-    struct stat st {};
-    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
-    return st;
-}
-
 void makeItem(const stdfs::path& path, bool isDir, mode_t mode, uid_t owner = 0) {
     if (isDir)
         stdfs::create_directory(path);
     else
-        test::writeFile(path, "contents");
+        writeFile(path, "contents");
     ASSERT_EQ(::chmod(path.c_str(), mode), 0) << path;
     ASSERT_EQ(::chown(path.c_str(), owner, owner), 0) << path;
 }
@@ -104,7 +86,7 @@ class BTHFileManagerACL : public ::testing::Test {
         return top;
     }
 
-    test::ScratchDir dir_;
+    ScratchDir dir_;
 };
 
 // Owner and others nothing (set-id and sticky bits cleared), the group bits
@@ -166,7 +148,7 @@ TEST_F(BTHFileManagerACL, AllSystemContainersOfADirectory) {
     makeItem(systemDir / "A", true, 0755);
     makeItem(systemDir / "B", true, 0755);
     makeItem(systemDir / "B/file", false, 0644);
-    test::LogCapture log;
+    LogCapture log;
     ASSERT_TRUE(manager().standardizeAllSystemContainerACLsAtURL(systemDir, &error))
         << describe(error);
     EXPECT_TRUE(log.contains(5, "Potential containers requiring ACL migration"));
@@ -242,8 +224,7 @@ bool canWriteAndRead(const std::string& path, int extraFlags = 0) {
 int abilitiesOf(uid_t uid, const std::vector<gid_t>& groups, const stdfs::path& top) {
     const std::string me = std::to_string(uid), library = (top / "Library").string();
     const std::string ownDir = library + "/dir-" + me;
-    const pid_t pid = ::fork();
-    if (pid == 0) {
+    const int status = inChild([&] {
         if (::setgroups(groups.size(), groups.data()) != 0 || ::setgid(uid) != 0 ||
             ::setuid(uid) != 0)
             ::abort();
@@ -257,11 +238,9 @@ int abilitiesOf(uid_t uid, const std::vector<gid_t>& groups, const stdfs::path& 
         if (::mkdir(ownDir.c_str(), 0777) == 0 && canWriteAndRead(ownDir + "/file", O_CREAT))
             abilities |= WorkInOwnSubdirectory;
         if (canWriteAndRead(library + "/dir-499/file")) abilities |= UseFirstMembersWork;
-        ::_exit(abilities);
-    }
-    int status = 0;
-    if (pid < 0 || ::waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) return -1;
-    return WEXITSTATUS(status);
+        return abilities;
+    });
+    return status > kAllAbilities ? -1 : status;
 }
 
 TEST_F(BTHFileManagerACL, MembersOfTheGroupHaveAccessAndOthersNone) {
@@ -320,7 +299,7 @@ TEST_F(BTHFileManagerACL, PlantedLinksDoNotHandOutsideItemsOver) {
         stdfs::create_directory_symlink(dir_ / "dir", top / "Library/dirlink");
         stdfs::create_symlink(dir_ / "file", top / "filelink");
 
-        test::LogCapture log;
+        LogCapture log;
         BTHErrorRef error;
         EXPECT_TRUE(kind.standardize(top, &error)) << describe(error);
         for (const auto& item : outside) {
@@ -339,14 +318,14 @@ TEST_F(BTHFileManagerACL, PlantedLinksDoNotHandOutsideItemsOver) {
 // Takes "systemusers" out of the device's group file while it lives.
 class WithoutSystemUsersGroup {
   public:
-    WithoutSystemUsersGroup() : path_(kRoot / "etc/group"), saved_(test::readFile(path_)) {
+    WithoutSystemUsersGroup() : path_(kRoot / "etc/group"), saved_(readFile(path_)) {
         std::string kept, line;
         std::istringstream in(saved_);
         while (std::getline(in, line))
             if (line.rfind("systemusers:", 0) != 0) kept += line + "\n";
-        test::writeFile(path_, kept);
+        writeFile(path_, kept);
     }
-    ~WithoutSystemUsersGroup() { test::writeFile(path_, saved_); }
+    ~WithoutSystemUsersGroup() { writeFile(path_, saved_); }
 
   private:
     stdfs::path path_;
@@ -369,7 +348,7 @@ TEST_F(BTHFileManagerACL, AnUnresolvableGroupFailsEveryACLOperationAndChangesNot
     };
     for (size_t i = 0; i < std::size(operations); ++i) {
         SCOPED_TRACE("operation " + std::to_string(i));
-        test::LogCapture log;
+        LogCapture log;
         BTHErrorRef error;
         EXPECT_FALSE(operations[i](&error));
         ASSERT_TRUE(error);

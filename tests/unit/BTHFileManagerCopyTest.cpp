@@ -2,22 +2,12 @@
 // texts, and a source tree whose app swaps a subdirectory for a link while
 // it is being copied.
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <sys/acl.h>
-#include <sys/stat.h>
 #include <sys/xattr.h>
-#include <unistd.h>
 
-#include <atomic>
-#include <chrono>
-#include <filesystem>
 #include <map>
 #include <sstream>
-#include <string>
-#include <thread>
-#include <vector>
 
-#include "BTHFileManager.h"
 #include "TestSupport.h"
 #include "platform/FileFlags.h"
 #include "platform/UniqueFd.h"
@@ -26,11 +16,7 @@ namespace berth {
 namespace {
 
 namespace stdfs = std::filesystem;
-using test::ScratchDir;
-
-BTHFileManager& manager() {
-    return BTHFileManager::defaultManager();
-}
+using namespace test;
 
 unsigned flagsOf(const stdfs::path& path) {
     UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
@@ -53,12 +39,6 @@ std::string contentsOf(const stdfs::path& path) {
     for (ssize_t n; fd && (n = ::read(fd.get(), buffer, sizeof buffer)) > 0;)
         data.append(buffer, size_t(n));
     return data;
-}
-
-struct timespec accessTime(const stdfs::path& path) {
-    struct stat st {};
-    ::lstat(path.c_str(), &st);
-    return st.st_atim;
 }
 
 // Everything a copy must keep of one item, as text.
@@ -116,9 +96,9 @@ void buildRichTree(const stdfs::path& root) {
     stdfs::create_directories(root / "sub/empty");
     std::string data(300000, '\0');
     for (size_t i = 0; i < data.size(); ++i) data[i] = char(i * 7 + i / 977);
-    test::writeFile(root / "file", data);
-    test::writeFile(root / "sub/frozen", "frozen");
-    test::writeFile(root / "sub/journal", "append only");
+    writeFile(root / "file", data);
+    writeFile(root / "sub/frozen", "frozen");
+    writeFile(root / "sub/journal", "append only");
     ASSERT_EQ(::symlink("../nowhere/dangling", (root / "sub/link").c_str()), 0);
     ASSERT_EQ(::mkfifo((root / "fifo").c_str(), 0600), 0);
 
@@ -154,10 +134,10 @@ TEST(BTHFileManagerCopy, KeepsDataModeOwnerTimesAttributesAclsFlagsAndLinks) {
     const stdfs::path source = dir / "source", dest = dir / "dest";
     buildRichTree(source);
     const auto before = describeTree(source);
-    const struct timespec linkAccess = accessTime(source / "sub/link");
+    const struct timespec linkAccess = lstatOf(source / "sub/link").st_atim;
     BTHErrorRef error;
     const bool copied = manager().copyItemAtURL(source, dest, &error);
-    const struct timespec copiedLinkAccess = accessTime(dest / "sub/link");
+    const struct timespec copiedLinkAccess = lstatOf(dest / "sub/link").st_atim;
     const auto after = describeTree(dest);
     clearFlags(source);
     clearFlags(dest);
@@ -177,32 +157,22 @@ TEST(BTHFileManagerCopy, MissingSourcesAndFailuresCarryTheirTexts) {
     EXPECT_FALSE(error);
     EXPECT_FALSE(stdfs::exists(dest));
 
+    const std::string what = missing.string() + " to " + dest.string() + " failed: ";
     EXPECT_FALSE(manager().copyItemAtURL(missing, dest, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOENT));
-    EXPECT_EQ(error->localizedDescription(), "copyfile of " + missing.string() + " to " +
-                                                 dest.string() + " failed: " + strerror(ENOENT));
-    EXPECT_EQ(error->functionName(),
-              "-[BTHFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]");
-
+    expectPOSIXError(error, ENOENT, "copyfile of " + what + strerror(ENOENT),
+                     "-[BTHFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]");
     EXPECT_FALSE(manager().moveItemAtURL(missing, dest, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOENT));
-    EXPECT_EQ(error->localizedDescription(), "rename of " + missing.string() + " to " +
-                                                 dest.string() + " failed: " + strerror(ENOENT));
-    EXPECT_EQ(error->functionName(),
-              "-[BTHFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]");
+    expectPOSIXError(error, ENOENT, "rename of " + what + strerror(ENOENT),
+                     "-[BTHFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]");
     EXPECT_FALSE(stdfs::exists(dest));
 
     // The existence check of the "if exists" forms does not go through links.
     ScratchDir outside;
-    test::writeFile(outside / "item", "x");
+    writeFile(outside / "item", "x");
     stdfs::create_directory_symlink(outside.path(), dir / "via");
     EXPECT_FALSE(manager().moveItemIfExistsAtURL(dir / "via/item", dest, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ELOOP));
-    EXPECT_EQ(error->localizedDescription(),
-              "stat of " + (dir / "via/item").string() + " failed: " + strerror(ELOOP));
+    expectPOSIXError(error, ELOOP,
+                     "stat of " + (dir / "via/item").string() + " failed: " + strerror(ELOOP));
     EXPECT_TRUE(stdfs::exists(outside / "item"));
 }
 
@@ -210,27 +180,21 @@ TEST(BTHFileManagerCopy, SameVolumeMoveRenamesAndAReplacedCopyTargetIsNeverFollo
     ScratchDir dir;
     ScratchDir outside;
     stdfs::create_directories(dir / "a/inner");
-    test::writeFile(dir / "a/inner/file", "payload");
-    const struct stat before = [&] {
-        struct stat st;
-        ::lstat((dir / "a").c_str(), &st);
-        return st;
-    }();
+    writeFile(dir / "a/inner/file", "payload");
+    const ino_t before = lstatOf(dir / "a").st_ino;
     BTHErrorRef error;
     ASSERT_TRUE(manager().moveItemAtURL(dir / "a", dir / "b", &error));
-    struct stat after;
-    ASSERT_EQ(::lstat((dir / "b").c_str(), &after), 0);
-    EXPECT_EQ(after.st_ino, before.st_ino);  // renamed, not copied
+    EXPECT_EQ(lstatOf(dir / "b").st_ino, before);  // renamed, not copied
     EXPECT_FALSE(stdfs::exists(dir / "a"));
 
     // A link standing where a copied file goes is replaced, not written through.
-    test::writeFile(outside / "victim", "untouched");
+    writeFile(outside / "victim", "untouched");
     stdfs::create_directories(dir / "c/inner");
     stdfs::create_symlink(outside / "victim", dir / "c/inner/file");
     ASSERT_TRUE(manager().copyItemAtURL(dir / "b", dir / "c", &error));
-    EXPECT_EQ(test::readFile(dir / "c/inner/file"), "payload");
+    EXPECT_EQ(readFile(dir / "c/inner/file"), "payload");
     EXPECT_FALSE(stdfs::is_symlink(dir / "c/inner/file"));
-    EXPECT_EQ(test::readFile(outside / "victim"), "untouched");
+    EXPECT_EQ(readFile(outside / "victim"), "untouched");
 }
 
 // The app owning a tree swaps one of its subdirectories for a link to a
@@ -242,8 +206,8 @@ TEST(BTHFileManagerCopy, ASubdirectorySwappedForALinkMidCopyIsCopiedAsALink) {
     ScratchDir outside;
     stdfs::create_directories(outside / "secret/inner");
     for (int i = 0; i < 100; ++i) {
-        test::writeFile(outside / ("secret/f" + std::to_string(i * 5)), "secret");
-        test::writeFile(outside / ("secret/inner/f" + std::to_string(i * 5)), "secret");
+        writeFile(outside / ("secret/f" + std::to_string(i * 5)), "secret");
+        writeFile(outside / ("secret/inner/f" + std::to_string(i * 5)), "secret");
     }
     constexpr int kRounds = 6;
     constexpr int kFilesPerDirectory = 600;
@@ -251,34 +215,16 @@ TEST(BTHFileManagerCopy, ASubdirectorySwappedForALinkMidCopyIsCopiedAsALink) {
     for (const char* d : {"a", "victim", "victim/inner", "z"}) {
         stdfs::create_directories(tree / d);
         for (int i = 0; i < kFilesPerDirectory; ++i)
-            test::writeFile(tree / d / ("f" + std::to_string(i)), "mine");
+            writeFile(tree / d / ("f" + std::to_string(i)), "mine");
     }
     int linksCopied = 0;
     for (int round = 0; round < kRounds; ++round) {
-        std::atomic<bool> stop{false};
-        std::thread app([&] {
-            const stdfs::path victim = tree / "victim", aside = tree / "victim.real";
-            const stdfs::path inner = aside / "inner", innerAside = tree / "inner.real";
-            const std::string target = (outside / "secret").string();
-            while (!stop.load()) {
-                if (::rename(victim.c_str(), aside.c_str()) == 0) {
-                    ::symlink(target.c_str(), victim.c_str());
-                    ::rename(inner.c_str(), innerAside.c_str());
-                    ::symlink((target + "/inner").c_str(), inner.c_str());
-                    std::this_thread::sleep_for(std::chrono::microseconds(100));
-                    ::unlink(inner.c_str());
-                    ::rename(innerAside.c_str(), inner.c_str());
-                    ::unlink(victim.c_str());
-                    ::rename(aside.c_str(), victim.c_str());
-                }
-                std::this_thread::sleep_for(std::chrono::microseconds(100));
-            }
-        });
         const stdfs::path dest = dir / ("copy" + std::to_string(round));
-        BTHErrorRef error;
-        manager().copyItemAtURL(tree, dest, &error);
-        stop = true;
-        app.join();
+        {
+            const LinkSwapper app(tree, outside / "secret");
+            BTHErrorRef error;
+            manager().copyItemAtURL(tree, dest, &error);
+        }
         if (!stdfs::exists(dest)) continue;
         for (const auto& e : stdfs::recursive_directory_iterator(dest)) {
             if (e.is_symlink()) {
@@ -286,7 +232,7 @@ TEST(BTHFileManagerCopy, ASubdirectorySwappedForALinkMidCopyIsCopiedAsALink) {
                 continue;
             }
             if (e.is_regular_file()) {
-                ASSERT_EQ(test::readFile(e.path()), "mine")
+                ASSERT_EQ(readFile(e.path()), "mine")
                     << "round " << round << ": " << e.path() << " came from outside";
             }
         }

@@ -2,34 +2,21 @@
 // and walks and removals that must not enter a mount inside their tree. The
 // test process gets a private mount namespace, so its tmpfs mounts are seen
 // by nobody else and vanish with it.
-#include <fcntl.h>
-#include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
-#include <sys/stat.h>
 #include <sys/xattr.h>
-#include <unistd.h>
 
-#include <cstring>
-#include <filesystem>
 #include <map>
-#include <string>
-#include <vector>
 
-#include "BTHFileManager.h"
 #include "TestSupport.h"
 
 namespace berth {
 namespace {
 
 namespace stdfs = std::filesystem;
-using test::LogCapture;
-using test::ScratchDir;
+using namespace test;
 using Kind = BTHWalkEntry::Kind;
-
-BTHFileManager& manager() {
-    return BTHFileManager::defaultManager();
-}
+using Kinds = std::map<std::string, std::vector<Kind>>;
 
 class BTHFileManagerCrossDevice : public ::testing::Test {
   protected:
@@ -70,15 +57,20 @@ class BTHFileManagerCrossDevice : public ::testing::Test {
     static inline std::string namespaceError_;
 };
 
-struct stat lstatOf(const stdfs::path& path) {
-    struct stat st {};
-    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
-    return st;
+// The kinds of entries the walk of `root` delivered, by relative path.
+Kinds walked(const stdfs::path& root) {
+    Kinds seen;
+    BTHErrorRef error;
+    EXPECT_TRUE(manager().traverseDirectory(root, &error, [&](const BTHWalkEntry& e, BTHErrorRef*) {
+        seen[e.path.lexically_relative(root).string()].push_back(e.kind);
+        return true;
+    }));
+    return seen;
 }
 
 void buildSource(const stdfs::path& source) {
     stdfs::create_directories(source / "sub");
-    test::writeFile(source / "sub/file", "contents");
+    writeFile(source / "sub/file", "contents");
     ASSERT_EQ(::chown((source / "sub/file").c_str(), 501, 502), 0);
     ASSERT_EQ(::chmod((source / "sub/file").c_str(), 0604), 0);
     ASSERT_EQ(
@@ -99,7 +91,7 @@ TEST_F(BTHFileManagerCrossDevice, MoveCopiesThenRemovesTheSource) {
     ASSERT_TRUE(manager().moveItemAtURL(source, dest, &error))
         << (error ? error->description() : "");
     EXPECT_FALSE(stdfs::exists(stdfs::symlink_status(source)));
-    EXPECT_EQ(test::readFile(dest / "sub/file"), "contents");
+    EXPECT_EQ(readFile(dest / "sub/file"), "contents");
     const struct stat file = lstatOf(dest / "sub/file");
     EXPECT_EQ(file.st_uid, 501u);
     EXPECT_EQ(file.st_gid, 502u);
@@ -113,8 +105,8 @@ TEST_F(BTHFileManagerCrossDevice, MoveCopiesThenRemovesTheSource) {
 TEST_F(BTHFileManagerCrossDevice, ASourceThatWillNotGoIsLoggedAndTheMoveStillSucceeds) {
     const stdfs::path source = dir_ / "source", volume = dir_ / "volume";
     buildSource(source);
-    test::writeFile(source / "frozen", "f");
-    ASSERT_TRUE(test::setImmutable(source / "frozen", true));
+    writeFile(source / "frozen", "f");
+    ASSERT_TRUE(setImmutable(source / "frozen", true));
     mountTmpfs(volume);
     LogCapture log;
     BTHErrorRef error;
@@ -122,78 +114,63 @@ TEST_F(BTHFileManagerCrossDevice, ASourceThatWillNotGoIsLoggedAndTheMoveStillSuc
     EXPECT_FALSE(error);
     EXPECT_TRUE(log.contains(
         BTHLogLevelError, "Failed to remove source " + source.string() + " : " + strerror(EPERM)));
-    EXPECT_EQ(test::readFile(volume / "moved/frozen"), "f");
+    EXPECT_EQ(readFile(volume / "moved/frozen"), "f");
     EXPECT_TRUE(stdfs::exists(source / "frozen"));
     EXPECT_FALSE(stdfs::exists(source / "sub"));  // the rest of the source went
-    test::setImmutable(volume / "moved/frozen", false);
+    setImmutable(volume / "moved/frozen", false);
 }
 
 TEST_F(BTHFileManagerCrossDevice, AFailedCopyFailsTheMoveAndLeavesTheSourceAlone) {
     const stdfs::path source = dir_ / "source", volume = dir_ / "volume";
     buildSource(source);
     const std::string big(1 << 20, 'b');
-    test::writeFile(source / "sub/big", big);
+    writeFile(source / "sub/big", big);
     mountTmpfs(volume, "size=64k,mode=0755");
     const stdfs::path dest = volume / "moved";
     BTHErrorRef error;
     EXPECT_FALSE(manager().moveItemAtURL(source, dest, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOSPC)) << error->description();
-    EXPECT_EQ(error->localizedDescription(), "copyfile of " + source.string() + " to " +
-                                                 dest.string() + " failed: " + strerror(ENOSPC));
-    EXPECT_EQ(error->functionName(),
-              "-[BTHFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]");
-    EXPECT_EQ(test::readFile(source / "sub/big"), big);
-    EXPECT_EQ(test::readFile(source / "sub/file"), "contents");
+    expectPOSIXError(
+        error, ENOSPC,
+        "copyfile of " + source.string() + " to " + dest.string() + " failed: " + strerror(ENOSPC),
+        "-[BTHFileManager _copyItemAtURL:toURL:failIfSrcMissing:error:]");
+    EXPECT_EQ(readFile(source / "sub/big"), big);
+    EXPECT_EQ(readFile(source / "sub/file"), "contents");
     EXPECT_FALSE(stdfs::exists(stdfs::symlink_status(dest)));  // no half copy left behind
 }
 
 TEST_F(BTHFileManagerCrossDevice, WalkAndRemovalStayOnTheirOwnFileSystem) {
     const stdfs::path root = dir_ / "root";
     stdfs::create_directories(root / "plain");
-    test::writeFile(root / "plain/file", "");
+    writeFile(root / "plain/file", "");
     mountTmpfs(root / "mnt");
-    test::writeFile(root / "mnt/inside", "other file system");
+    writeFile(root / "mnt/inside", "other file system");
 
-    std::map<std::string, std::vector<Kind>> seen;
-    BTHErrorRef error;
-    ASSERT_TRUE(manager().traverseDirectory(root, &error, [&](const BTHWalkEntry& e, BTHErrorRef*) {
-        seen[e.path.lexically_relative(root).string()].push_back(e.kind);
-        return true;
-    }));
-    const std::map<std::string, std::vector<Kind>> expected = {
+    const Kinds expected = {
         {".", {Kind::DirectoryPre, Kind::DirectoryPost}},
         {"plain", {Kind::DirectoryPre, Kind::DirectoryPost}},
         {"plain/file", {Kind::File}},
         {"mnt", {Kind::DirectoryPre, Kind::DirectoryPost}},
     };
-    EXPECT_EQ(seen, expected);
-
+    EXPECT_EQ(walked(root), expected);
+    BTHErrorRef error;
     EXPECT_FALSE(manager().removeItemAtURL(root, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(EXDEV)) << error->description();
-    EXPECT_EQ(test::readFile(root / "mnt/inside"), "other file system");
+    expectPOSIXError(error, EXDEV);
+    EXPECT_EQ(readFile(root / "mnt/inside"), "other file system");
     EXPECT_FALSE(stdfs::exists(root / "plain"));
 }
 
 TEST_F(BTHFileManagerCrossDevice, ADirectoryMountedInsideItselfIsACycleNotEntered) {
     const stdfs::path root = dir_ / "root";
     stdfs::create_directories(root / "sub/loop");
-    test::writeFile(root / "file", "");
+    writeFile(root / "file", "");
     bindMount(root, root / "sub/loop");
-    std::map<std::string, std::vector<Kind>> seen;
-    BTHErrorRef error;
-    ASSERT_TRUE(manager().traverseDirectory(root, &error, [&](const BTHWalkEntry& e, BTHErrorRef*) {
-        seen[e.path.lexically_relative(root).string()].push_back(e.kind);
-        return true;
-    }));
-    const std::map<std::string, std::vector<Kind>> expected = {
+    const Kinds expected = {
         {".", {Kind::DirectoryPre, Kind::DirectoryPost}},
         {"file", {Kind::File}},
         {"sub", {Kind::DirectoryPre, Kind::DirectoryPost}},
         {"sub/loop", {Kind::DirectoryCycle}},
     };
-    EXPECT_EQ(seen, expected);
+    EXPECT_EQ(walked(root), expected);
 }
 
 }  // namespace

@@ -2,16 +2,9 @@
 #include "BTHFileManager.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cctype>
-#include <filesystem>
-#include <functional>
-#include <set>
 
 #include "TestSupport.h"
 #include "platform/ProtectionClass.h"
@@ -21,31 +14,13 @@ namespace berth {
 namespace {
 
 namespace stdfs = std::filesystem;
-using test::ScratchDir;
-
-BTHFileManager& manager() {
-    return BTHFileManager::defaultManager();
-}
-
-struct stat lstatOf(const stdfs::path& path) {
-    struct stat st {};
-    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
-    return st;
-}
+using namespace test;
 
 int32_t classOf(const stdfs::path& path) {
     UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
     int32_t value = -100;
     EXPECT_EQ(protection::getClass(fd.get(), &value, [] { return false; }), 0) << path;
     return value;
-}
-
-void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& description,
-                      const std::string& function) {
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(code)) << error->description();
-    EXPECT_EQ(error->localizedDescription(), description);
-    EXPECT_EQ(error->functionName(), function);
 }
 
 constexpr const char* kCreateName =
@@ -107,7 +82,7 @@ TEST(BTHFileManagerCreateDirectory, FailuresCarryTheirCallAndErrorNumber) {
                      kCreateName);
     EXPECT_FALSE(stdfs::exists(dir / "missing"));
 
-    test::writeFile(dir / "file", "x");
+    writeFile(dir / "file", "x");
     const stdfs::path underFile = dir / "file/child";
     error.reset();
     EXPECT_FALSE(manager().createDirectoryAtURL(underFile, true, 0755, &error));
@@ -126,7 +101,7 @@ TEST(BTHFileManagerCreateDirectory, FailuresCarryTheirCallAndErrorNumber) {
 
     // An immutable directory refuses its class.
     ASSERT_EQ(::mkdir((dir / "frozen").c_str(), 0755), 0);
-    ASSERT_TRUE(test::setImmutable(dir / "frozen", true));
+    ASSERT_TRUE(setImmutable(dir / "frozen", true));
     error.reset();
     EXPECT_FALSE(manager().createDirectoryAtURLWithClass(dir / "frozen", false, 0755, 3, &error));
     expectPOSIXError(
@@ -142,9 +117,9 @@ TEST(BTHFileManagerCreateDirectory, NeverCreatesOrChangesAnythingThroughALink) {
     ASSERT_EQ(::symlink(outside.path().c_str(), (dir / "link").c_str()), 0);
     BTHErrorRef error;
     EXPECT_FALSE(manager().createDirectoryAtURL(dir / "link/new/deeper", true, 0755, &error));
-    EXPECT_TRUE(error && error->isPOSIXError(ELOOP));
+    expectPOSIXError(error, ELOOP);
     EXPECT_FALSE(manager().createDirectoryAtURL(dir / "link/new", false, 0755, &error));
-    EXPECT_TRUE(error && error->isPOSIXError(ELOOP));
+    expectPOSIXError(error, ELOOP);
     EXPECT_FALSE(stdfs::exists(outside / "new"));
 
     // A link as the last component is taken as existing, but neither owner
@@ -153,7 +128,7 @@ TEST(BTHFileManagerCreateDirectory, NeverCreatesOrChangesAnythingThroughALink) {
     EXPECT_TRUE(manager().createDirectoryAtURL(dir / "link", false, 0755, 501, &error));
     EXPECT_EQ(lstatOf(outside.path()).st_uid, before.st_uid);
     EXPECT_FALSE(manager().createDirectoryAtURLWithClass(dir / "link", false, 0755, 3, &error));
-    EXPECT_TRUE(error && error->isPOSIXError(ELOOP));
+    expectPOSIXError(error, ELOOP);
     EXPECT_EQ(classOf(outside.path()), 0);
 }
 
@@ -195,10 +170,10 @@ TEST(BTHFileManagerListing, ListsVisibleNamesAndFlagsDirectories) {
     ScratchDir dir;
     stdfs::create_directories(dir / "sub");
     stdfs::create_directories(dir / ".hidden-dir");
-    test::writeFile(dir / "file", "");
-    test::writeFile(dir / ".hidden", "");
+    writeFile(dir / "file", "");
+    writeFile(dir / ".hidden", "");
     stdfs::create_directory_symlink(dir / "sub", dir / "dirlink");
-    test::LogCapture log;
+    LogCapture log;
     BTHErrorRef error;
     auto items = manager().urlsForItemsInDirectoryAtURL(dir.path(), &error);
     ASSERT_TRUE(items);
@@ -211,41 +186,27 @@ TEST(BTHFileManagerListing, ListsVisibleNamesAndFlagsDirectories) {
 
     // A missing directory fails quietly; any other failure is logged.
     EXPECT_FALSE(manager().urlsForItemsInDirectoryAtURL(dir / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOENT));
+    expectPOSIXError(error, ENOENT);
     EXPECT_TRUE(log.lines().empty());
     EXPECT_FALSE(manager().urlsForItemsInDirectoryAtURL(dir / "file", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOTDIR));
+    expectPOSIXError(error, ENOTDIR);
     const std::string line =
         "opendir of " + (dir / "file").string() + " failed: " + strerror(ENOTDIR);
     ASSERT_EQ(log.count(BTHLogLevelError, line), 1u);
     EXPECT_EQ(log.lines().back().function, "_IterateDirectory");
 }
 
-// Runs `body` in a child process under `uid` and gives its exit status.
-int runAsUser(uid_t uid, const std::function<int()>& body) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        if (::setresgid(uid, uid, uid) != 0 || ::setresuid(uid, uid, uid) != 0) ::_exit(100);
-        ::_exit(body());
-    }
-    int status = 0;
-    ::waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 200;
-}
-
 TEST(BTHFileManagerExistence, TheTwoTestsAgreeOnlyWhenTheAnswerIsKnown) {
     BERTH_REQUIRE_ROOT();
     ScratchDir dir;
     ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
-    test::writeFile(dir / "file", "");
+    writeFile(dir / "file", "");
     stdfs::create_symlink(dir / "nowhere", dir / "dangling");
     for (const char* present : {"file", "dangling"}) {
         EXPECT_TRUE(manager().itemExistsAtURL(dir / present)) << present;
         EXPECT_FALSE(manager().itemDoesNotExistAtURL(dir / present)) << present;
     }
-    test::LogCapture log;
+    LogCapture log;
     EXPECT_FALSE(manager().itemExistsAtURL(dir / "missing"));
     EXPECT_TRUE(manager().itemDoesNotExistAtURL(dir / "missing"));
     EXPECT_TRUE(log.lines().empty());
@@ -253,18 +214,20 @@ TEST(BTHFileManagerExistence, TheTwoTestsAgreeOnlyWhenTheAnswerIsKnown) {
     // Behind a directory the caller may not search: neither answer is true,
     // and both say why.
     stdfs::create_directories(dir / "closed");
-    test::writeFile(dir / "closed/item", "");
+    writeFile(dir / "closed/item", "");
     ASSERT_EQ(::chmod((dir / "closed").c_str(), 0700), 0);
     const stdfs::path hidden = dir / "closed/item";
-    const int status = runAsUser(65534, [&] {
-        test::LogCapture childLog;
-        if (manager().itemExistsAtURL(hidden)) return 1;
-        if (manager().itemDoesNotExistAtURL(hidden)) return 2;
-        const std::string line =
-            "Failed to determine if " + hidden.string() + " exists: " + strerror(EACCES);
-        return childLog.count(BTHLogLevelError, line) == 2 ? 0 : 3;
-    });
-    EXPECT_EQ(status, 0);
+    EXPECT_EQ(inChild(
+                  [&] {
+                      LogCapture childLog;
+                      if (manager().itemExistsAtURL(hidden)) return 1;
+                      if (manager().itemDoesNotExistAtURL(hidden)) return 2;
+                      const std::string line = "Failed to determine if " + hidden.string() +
+                                               " exists: " + strerror(EACCES);
+                      return childLog.count(BTHLogLevelError, line) == 2 ? 0 : 3;
+                  },
+                  65534),
+              0);
 }
 
 }  // namespace

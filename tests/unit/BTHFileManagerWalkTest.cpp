@@ -2,29 +2,17 @@
 // callback reach, ending on the callback's answer, missing and unreadable
 // items.
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <filesystem>
 #include <map>
-#include <string>
-#include <vector>
 
-#include "BTHFileManager.h"
 #include "TestSupport.h"
 
 namespace berth {
 namespace {
 
 namespace stdfs = std::filesystem;
-using test::ScratchDir;
+using namespace test;
 using Kind = BTHWalkEntry::Kind;
-
-BTHFileManager& manager() {
-    return BTHFileManager::defaultManager();
-}
 
 struct Visit {
     std::string path;  // relative to the walk's parent directory
@@ -55,12 +43,12 @@ size_t indexOf(const std::vector<Visit>& visits, const std::string& path, Kind k
 TEST(BTHFileManagerWalk, DeliversEveryItemOnceWithItsKindLevelAndWhereItLives) {
     ScratchDir dir;
     ScratchDir outside;
-    test::writeFile(outside / "not-visited", "");
+    writeFile(outside / "not-visited", "");
     const stdfs::path root = dir / "root";
     stdfs::create_directories(root / "sub/deeper");
     stdfs::create_directories(root / "empty");
-    test::writeFile(root / "file", "x");
-    test::writeFile(root / "sub/deeper/file", "y");
+    writeFile(root / "file", "x");
+    writeFile(root / "sub/deeper/file", "y");
     stdfs::create_directory_symlink(outside.path(), root / "sub/link");
     ASSERT_EQ(::mkfifo((root / "fifo").c_str(), 0600), 0);
 
@@ -117,7 +105,7 @@ TEST(BTHFileManagerWalk, DeliversEveryItemOnceWithItsKindLevelAndWhereItLives) {
 TEST(BTHFileManagerWalk, EndsOnTheCallbacksAnswerWithItsError) {
     ScratchDir dir;
     stdfs::create_directories(dir / "root/a/b/c");
-    test::writeFile(dir / "root/a/b/c/file", "");
+    writeFile(dir / "root/a/b/c/file", "");
     int calls = 0;
     BTHErrorRef error;
     const BTHErrorRef mine = BTHCreatePOSIXError("test", 1, EIO, "stop here");
@@ -146,24 +134,9 @@ TEST(BTHFileManagerWalk, AMissingRootFailsWithoutACallback) {
         BTHErrorRef error;
         EXPECT_TRUE(walkAll(root, &ok, &error).empty());
         EXPECT_FALSE(ok);
-        ASSERT_TRUE(error);
-        EXPECT_TRUE(error->isPOSIXError(ENOENT));
-        EXPECT_EQ(error->localizedDescription(),
-                  "Error for path " + root.string() + ": " + strerror(ENOENT));
-        EXPECT_EQ(error->functionName(), "-[BTHFileManager _traverseDirectory:error:withBlock:]");
+        expectPOSIXError(error, ENOENT, "Error for path " + root.string() + ": " + strerror(ENOENT),
+                         "-[BTHFileManager _traverseDirectory:error:withBlock:]");
     }
-}
-
-// Runs `body` in a child process under `uid` and gives its exit status.
-int runAsUser(uid_t uid, const std::function<int()>& body) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        if (::setresgid(uid, uid, uid) != 0 || ::setresuid(uid, uid, uid) != 0) ::_exit(100);
-        ::_exit(body());
-    }
-    int status = 0;
-    ::waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 200;
 }
 
 TEST(BTHFileManagerWalk, AnUnreadableDirectoryIsDeliveredAndTheWalkGoesOn) {
@@ -172,26 +145,28 @@ TEST(BTHFileManagerWalk, AnUnreadableDirectoryIsDeliveredAndTheWalkGoesOn) {
     ASSERT_EQ(::chmod(dir.path().c_str(), 0755), 0);
     const stdfs::path root = dir / "root";
     stdfs::create_directories(root / "closed/inside");
-    test::writeFile(root / "after", "");
+    writeFile(root / "after", "");
     ASSERT_EQ(::chmod((root / "closed").c_str(), 0), 0);
     // As an unprivileged user: the closed directory cannot be opened.
-    const int status = runAsUser(65534, [&] {
-        bool ok = false;
-        BTHErrorRef error;
-        const auto visits = walkAll(root, &ok, &error);
-        if (!ok) return 1;
-        std::vector<std::pair<std::string, Kind>> closed;
-        bool sawAfter = false;
-        for (const auto& v : visits) {
-            if (v.path.rfind("root/closed", 0) == 0) closed.emplace_back(v.path, v.kind);
-            if (v.kind == Kind::Unreadable && v.errnum != EACCES) return 4;
-            sawAfter |= v.path == "root/after";
-        }
-        const std::vector<std::pair<std::string, Kind>> expected = {
-            {"root/closed", Kind::DirectoryPre}, {"root/closed", Kind::Unreadable}};
-        if (closed != expected) return 2;
-        return sawAfter ? 0 : 3;
-    });
+    const int status = inChild(
+        [&] {
+            bool ok = false;
+            BTHErrorRef error;
+            const auto visits = walkAll(root, &ok, &error);
+            if (!ok) return 1;
+            std::vector<std::pair<std::string, Kind>> closed;
+            bool sawAfter = false;
+            for (const auto& v : visits) {
+                if (v.path.rfind("root/closed", 0) == 0) closed.emplace_back(v.path, v.kind);
+                if (v.kind == Kind::Unreadable && v.errnum != EACCES) return 4;
+                sawAfter |= v.path == "root/after";
+            }
+            const std::vector<std::pair<std::string, Kind>> expected = {
+                {"root/closed", Kind::DirectoryPre}, {"root/closed", Kind::Unreadable}};
+            if (closed != expected) return 2;
+            return sawAfter ? 0 : 3;
+        },
+        65534);
     EXPECT_EQ(status, 0);
 }
 
