@@ -7,6 +7,7 @@
 #include <sys/ioctl.h>
 #include <sys/wait.h>
 
+#include <bit>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
@@ -152,6 +153,38 @@ void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& des
     if (!function.empty()) {
         EXPECT_EQ(error->functionName(), function);
     }
+}
+
+::testing::AssertionResult identical(const Value& a, const Value& b, const std::string& at) {
+    auto differ = [&](const std::string& what) {
+        return ::testing::AssertionFailure() << at << ": " << what;
+    };
+    if (a.kind() != b.kind())
+        return differ(std::string(kindName(a.kind())) + " vs " + kindName(b.kind()));
+    auto bits = [](const Value& v) {
+        return std::bit_cast<uint64_t>(
+            v.kind() == Value::Kind::Double ? *v.doubleValue() : v.date()->secondsSince1970);
+    };
+    if (a.kind() == Value::Kind::Double || a.kind() == Value::Kind::Date)
+        return bits(a) == bits(b) ? ::testing::AssertionSuccess() : differ("bits differ");
+    if (auto* x = a.arrayValue()) {
+        if (x->size() != b.size()) return differ("array sizes differ");
+        for (size_t i = 0; i < x->size(); ++i)
+            if (auto r = identical((*x)[i], (*b.arrayValue())[i], at + std::to_string(i) + "/"); !r)
+                return r;
+        return ::testing::AssertionSuccess();
+    }
+    if (auto* x = a.dictionaryValue()) {
+        if (x->size() != b.size()) return differ("dictionary sizes differ");
+        for (const auto& [key, element] : *x) {
+            const Value* other = b.find(key);
+            if (!other) return differ("missing " + key);
+            if (auto r = identical(element, *other, at + key + "/"); !r) return r;
+        }
+        return ::testing::AssertionSuccess();
+    }
+    return a == b ? ::testing::AssertionSuccess()
+                  : differ(a.description() + " vs " + b.description());
 }
 
 bool eventually(const std::function<bool()>& condition, std::chrono::milliseconds limit) {

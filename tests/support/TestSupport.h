@@ -87,6 +87,10 @@ inline Value dict(Value::Dictionary members) {
     return Value(std::move(members));
 }
 
+// Equality that also demands the same integer kinds and the same bits of
+// floating-point numbers and dates, which Value's own == ignores.
+::testing::AssertionResult identical(const Value& a, const Value& b, const std::string& at = "/");
+
 // An error of `code` in the POSIX domain, with this description and function
 // when they are given.
 void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& description = {},
@@ -125,6 +129,12 @@ class LinkSwapper {
   private:
     std::atomic<bool> stop_{false};
     std::thread thread_;
+};
+
+// Death tests of programs with threads re-run the test program in the child.
+class ThreadsafeDeathTest : public ::testing::Test {
+  protected:
+    void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
 
 }  // namespace berth::test

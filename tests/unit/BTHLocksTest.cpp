@@ -1,17 +1,7 @@
 #include "BTHLocks.h"
 
-#include <gtest/gtest.h>
-#include <unistd.h>
-
 #include <array>
-#include <atomic>
-#include <chrono>
-#include <functional>
-#include <memory>
-#include <optional>
 #include <random>
-#include <set>
-#include <thread>
 
 #include "TestSupport.h"
 
@@ -19,15 +9,7 @@ namespace berth {
 namespace {
 
 using namespace std::chrono_literals;
-
-bool eventually(const std::function<bool()>& condition) {
-    auto deadline = std::chrono::steady_clock::now() + 10s;
-    while (!condition()) {
-        if (std::chrono::steady_clock::now() > deadline) return false;
-        std::this_thread::sleep_for(1ms);
-    }
-    return true;
-}
+using test::eventually;
 
 std::optional<BTHLocksSnapshot::Record> recordOf(const std::string& identifier) {
     for (const auto& record : BTHLocksSnapshotForTesting().records)

@@ -5,51 +5,25 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
-#include <atomic>
-#include <cstdlib>
 #include <fstream>
-#include <functional>
-#include <memory>
-#include <thread>
 
+#include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
 #include "platform/DeviceRoot.h"
 
 namespace berth {
 namespace {
 
+namespace fs = std::filesystem;
 using namespace std::chrono_literals;
-using test::ScratchDir;
+using namespace test;
 
-// The device root must be set before the first use of DeviceRoot, which no
-// test makes before the environment is set up; removed when the tests are done.
-class ScratchDeviceRoot : public ::testing::Environment {
-  public:
-    void SetUp() override {
-        char templ[] = "/tmp/berth-signing-root.XXXXXX";
-        ASSERT_NE(mkdtemp(templ), nullptr) << strerror(errno);
-        root_ = templ;
-        setenv("BERTH_ROOT", templ, 1);
-    }
-    void TearDown() override {
-        std::error_code ignored;
-        if (!root_.empty()) std::filesystem::remove_all(root_, ignored);
-    }
+[[maybe_unused]] const auto& kRoot = installScratchDeviceRoot();
 
-  private:
-    std::filesystem::path root_;
-};
-
-// gtest takes ownership of its environments.
-[[maybe_unused]] ::testing::Environment* const kDeviceRoot =
-    ::testing::AddGlobalTestEnvironment(std::make_unique<ScratchDeviceRoot>().release());
-
-ExecutableId idOf(const std::filesystem::path& path) {
+ExecutableId idOf(const fs::path& path) {
     struct stat status {};
     EXPECT_EQ(::stat(path.c_str(), &status), 0) << path;
     return {status.st_dev, status.st_ino};
@@ -83,10 +57,7 @@ class Child {
         EXPECT_TRUE(pidfd_.valid()) << strerror(errno);
     }
     ~Child() {
-        if (pid_ > 0 && !reaped_) {
-            ::kill(pid_, SIGKILL);
-            ::waitpid(pid_, nullptr, 0);
-        }
+        if (pid_ > 0 && !reaped_) reap();
     }
 
     pid_t pid() const { return pid_; }
@@ -111,31 +82,27 @@ class Child {
 };
 
 CodeSigningRegistry::Options withRacyWindow(std::chrono::nanoseconds window) {
-    CodeSigningRegistry::Options options;
-    options.racyWindow = window;
-    return options;
+    return {.directory = {}, .racyWindow = window};
 }
 
 Value sampleEntitlements() {
-    Value entitlements = Value::dictionary();
-    entitlements.set("sys.kelp.private.Berth.allowed", true);
-    entitlements.set("sys.kelp.private.Berth.wipeContainer",
-                     Value(Value::Array{Value("a.b.c"), Value("d.e.f")}));
-    return entitlements;
+    return dict({{"sys.kelp.private.Berth.allowed", true},
+                 {"sys.kelp.private.Berth.wipeContainer",
+                  Value(Value::Array{Value("a.b.c"), Value("d.e.f")})}});
 }
 
 class CodeSigningRegistryTest : public ::testing::Test {
   protected:
     void SetUp() override {
         BERTH_REQUIRE_ROOT();
-        std::filesystem::remove_all(DeviceRoot::resolve("/etc"));
+        fs::remove_all(DeviceRoot::resolve("/etc"));
         sleeper_ = copyOf("/bin/sleep", "sleeper");
     }
 
-    std::filesystem::path copyOf(const std::filesystem::path& source, const std::string& name) {
-        std::filesystem::path copy = bin_ / name;
-        std::filesystem::copy_file(source, copy, std::filesystem::copy_options::overwrite_existing);
-        std::filesystem::permissions(copy, std::filesystem::perms(0755));
+    fs::path copyOf(const fs::path& source, const std::string& name) {
+        fs::path copy = bin_ / name;
+        fs::copy_file(source, copy, fs::copy_options::overwrite_existing);
+        fs::permissions(copy, fs::perms(0755));
         return copy;
     }
 
@@ -144,30 +111,29 @@ class CodeSigningRegistryTest : public ::testing::Test {
         ASSERT_EQ(registry_.sign(sleeper_, identifier, sampleEntitlements(), &why), 0) << why;
     }
 
-    std::filesystem::path entryFile(const std::filesystem::path& executable) const {
+    fs::path entryFile(const fs::path& executable) const {
         return registry_.directory() / CodeSigningRegistry::entryFileName(executable);
     }
 
     Child startSleeper() { return Child({sleeper_.string(), "30"}); }
 
     ScratchDir bin_;
-    std::filesystem::path sleeper_;
+    fs::path sleeper_;
     // No racy window: a file copied a moment ago may be cached at once.
     CodeSigningRegistry registry_{withRacyWindow(0ns)};
 };
 
 TEST_F(CodeSigningRegistryTest, SignedExecutableIdentifiesItsProcesses) {
-    std::filesystem::create_symlink(sleeper_, bin_ / "link");
+    fs::create_symlink(sleeper_, bin_ / "link");
     SignatureEntry written;
     std::string why;
     ASSERT_EQ(registry_.sign(bin_ / "link", "sys.kelp.test.sleeper", sampleEntitlements(), &why,
                              &written),
               0)
         << why;
-    EXPECT_EQ(written.executablePath, std::filesystem::canonical(sleeper_));
+    EXPECT_EQ(written.executablePath, fs::canonical(sleeper_));
 
-    struct stat status {};
-    ASSERT_EQ(::lstat(entryFile(written.executablePath).c_str(), &status), 0);
+    const struct stat status = lstatOf(entryFile(written.executablePath));
     EXPECT_TRUE(S_ISREG(status.st_mode));
     EXPECT_EQ(status.st_uid, 0u);
     EXPECT_EQ(status.st_mode & 07777, 0644u);
@@ -205,7 +171,7 @@ TEST_F(CodeSigningRegistryTest, NoIdentityWithoutAMatchingSignature) {
 
     // The same contents at another path are not the signed executable.
     signSleeper();
-    std::filesystem::path twin = copyOf(sleeper_, "twin");
+    fs::path twin = copyOf(sleeper_, "twin");
     {
         Child child({twin.string(), "30"});
         EXPECT_FALSE(registry_.identify(child.pid(), child.pidfd(), &why));
@@ -232,40 +198,30 @@ TEST_F(CodeSigningRegistryTest, NoIdentityWithoutAMatchingSignature) {
 TEST_F(CodeSigningRegistryTest, UntrustedEntriesAreIgnored) {
     signSleeper();
     // Same contents as the sleeper, so only the entry's own path tells them apart.
-    std::filesystem::path other = copyOf(sleeper_, "other");
+    fs::path other = copyOf(sleeper_, "other");
     std::string why;
     ASSERT_EQ(registry_.sign(other, "sys.kelp.test.other", Value::dictionary(), &why), 0) << why;
-    const std::filesystem::path entry = entryFile(sleeper_);
-    const std::filesystem::path directory = registry_.directory();
-    const std::filesystem::path stash = bin_ / "stash";
-
+    const fs::path entry = entryFile(sleeper_), directory = registry_.directory();
+    const fs::path stash = bin_ / "stash", otherEntry = entryFile(other);
+    using Step = std::function<void()>;
+    auto chmodTo = [](fs::path p, mode_t m) -> Step { return [=] { ::chmod(p.c_str(), m); }; };
+    auto chownTo = [](fs::path p, uid_t u) -> Step { return [=] { ::chown(p.c_str(), u, u); }; };
+    const Step putBack = [&] { fs::rename(stash, entry); };
     struct Tamper {
         const char* what;
-        std::function<void()> apply, undo;
+        Step apply, undo;
     };
-    const std::vector<Tamper> tampers = {
-        {"entry group-writable", [&] { ::chmod(entry.c_str(), 0664); },
-         [&] { ::chmod(entry.c_str(), 0644); }},
-        {"entry other-writable", [&] { ::chmod(entry.c_str(), 0646); },
-         [&] { ::chmod(entry.c_str(), 0644); }},
-        {"entry not root's", [&] { ::chown(entry.c_str(), 65534, 65534); },
-         [&] { ::chown(entry.c_str(), 0, 0); }},
-        {"directory group-writable", [&] { ::chmod(directory.c_str(), 0775); },
-         [&] { ::chmod(directory.c_str(), 0755); }},
-        {"parent not root's", [&] { ::chown(directory.parent_path().c_str(), 65534, 0); },
-         [&] { ::chown(directory.parent_path().c_str(), 0, 0); }},
+    const Tamper tampers[] = {
+        {"entry group-writable", chmodTo(entry, 0664), chmodTo(entry, 0644)},
+        {"entry other-writable", chmodTo(entry, 0646), chmodTo(entry, 0644)},
+        {"entry not root's", chownTo(entry, 65534), chownTo(entry, 0)},
+        {"directory group-writable", chmodTo(directory, 0775), chmodTo(directory, 0755)},
+        {"parent not root's", chownTo(directory.parent_path(), 65534),
+         chownTo(directory.parent_path(), 0)},
         {"entry is a link to a good entry",
-         [&] {
-             std::filesystem::rename(entry, stash);
-             std::filesystem::create_symlink(stash, entry);
-         },
-         [&] { std::filesystem::rename(stash, entry); }},
+         [&] { fs::rename(entry, stash), fs::create_symlink(stash, entry); }, putBack},
         {"entry of another executable under this name",
-         [&] {
-             std::filesystem::rename(entry, stash);
-             std::filesystem::copy_file(entryFile(other), entry);
-         },
-         [&] { std::filesystem::rename(stash, entry); }},
+         [&] { fs::rename(entry, stash), fs::copy_file(otherEntry, entry); }, putBack},
     };
 
     Child child = startSleeper();
@@ -291,20 +247,17 @@ TEST_F(CodeSigningRegistryTest, UntrustedEntriesAreIgnored) {
 }
 
 TEST_F(CodeSigningRegistryTest, SignIsRootOnlyAndRefusesBadInput) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        if (::seteuid(65534) != 0) ::_exit(2);
-        CodeSigningRegistry registry;
-        const bool refused = registry.sign(sleeper_, "x", Value::dictionary()) == EPERM &&
-                             registry.remove(sleeper_) == EPERM;
-        ::_exit(refused ? 0 : 1);
-    }
-    int status = 0;
-    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+    EXPECT_EQ(inChild([&] {
+                  if (::seteuid(65534) != 0) return 2;
+                  CodeSigningRegistry registry;
+                  return registry.sign(sleeper_, "x", Value::dictionary()) == EPERM &&
+                                 registry.remove(sleeper_) == EPERM
+                             ? 0
+                             : 1;
+              }),
+              0);
 
-    Value withUuid = Value::dictionary();
-    withUuid.set("key", Uuid::random());
+    const Value withUuid = dict({{"key", Uuid::random()}});
     EXPECT_EQ(registry_.sign("relative/sleeper", "x", Value::dictionary()), EINVAL);
     EXPECT_EQ(registry_.sign(bin_.path(), "x", Value::dictionary()), EINVAL);
     EXPECT_EQ(registry_.sign(sleeper_, "", Value::dictionary()), EINVAL);
@@ -314,7 +267,7 @@ TEST_F(CodeSigningRegistryTest, SignIsRootOnlyAndRefusesBadInput) {
     EXPECT_TRUE(registry_.list().entries.empty());
 
     // A registry directory someone else could write to is not used.
-    std::filesystem::create_directories(registry_.directory());
+    fs::create_directories(registry_.directory());
     ::chown(registry_.directory().c_str(), 65534, 65534);
     std::string why;
     EXPECT_EQ(registry_.sign(sleeper_, "x", Value::dictionary(), &why), EPERM);
@@ -356,13 +309,9 @@ TEST_F(CodeSigningRegistryTest, ExecutableOfFollowsExec) {
     EXPECT_FALSE(registry_.identify(child.pid(), child.pidfd(), &why));
 
     ASSERT_EQ(::write(writeEnd.get(), "go\n", 3), 3);
-    std::optional<ExecutableId> now;
-    for (int attempt = 0; attempt < 1000; ++attempt) {
-        now = registry_.executableOf(child.pid(), child.pidfd());
-        if (now != idOf("/bin/sh")) break;
-        std::this_thread::sleep_for(10ms);
-    }
-    EXPECT_EQ(now, idOf(sleeper_));
+    EXPECT_TRUE(eventually(
+        [&] { return registry_.executableOf(child.pid(), child.pidfd()) != idOf("/bin/sh"); }));
+    EXPECT_EQ(registry_.executableOf(child.pid(), child.pidfd()), idOf(sleeper_));
     std::optional<PeerIdentity> identity = registry_.identify(child.pid(), child.pidfd(), &why);
     ASSERT_TRUE(identity) << why;
     EXPECT_EQ(identity->executable, idOf(sleeper_));
@@ -395,13 +344,13 @@ TEST_F(CodeSigningRegistryTest, ExecutableIsHashedOncePerVersion) {
 const char* kAbcSha256 = "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad";
 
 struct OpenFile {
-    std::filesystem::path path;
+    fs::path path;
     UniqueFd fd;
 };
 
 OpenFile makeFile(const ScratchDir& dir, const std::string& name, const std::string& text) {
     OpenFile file{dir / name, {}};
-    test::writeFile(file.path, text);
+    writeFile(file.path, text);
     file.fd.reset(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
     return file;
 }
@@ -421,7 +370,7 @@ TEST(DigestCacheTest, DigestFollowsContentsEvenWithMtimeRestored) {
     ASSERT_EQ(::fstat(file.fd.get(), &before), 0);
     struct stat after {};
     do {
-        test::writeFile(file.path, "abd");
+        writeFile(file.path, "abd");
         struct timespec times[2] = {before.st_atim, before.st_mtim};
         ASSERT_EQ(::utimensat(AT_FDCWD, file.path.c_str(), times, 0), 0);
         ASSERT_EQ(::fstat(file.fd.get(), &after), 0);

@@ -1,60 +1,16 @@
 #include "core/RelayCodec.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
 #include <bit>
-#include <climits>
-#include <cmath>
 #include <limits>
+
+#include "TestSupport.h"
 
 namespace berth::relay {
 namespace {
 
 using Bytes = std::vector<uint8_t>;
-
-// Equality that also demands the same integer kind and the same bits of
-// floating-point numbers, both of which Value's own == deliberately ignores.
-::testing::AssertionResult identical(const Value& a, const Value& b, const std::string& at = "/") {
-    if (a.kind() != b.kind()) {
-        return ::testing::AssertionFailure()
-               << at << ": " << kindName(a.kind()) << " vs " << kindName(b.kind());
-    }
-    if (a.kind() == Value::Kind::Double &&
-        std::bit_cast<uint64_t>(*a.doubleValue()) != std::bit_cast<uint64_t>(*b.doubleValue())) {
-        return ::testing::AssertionFailure() << at << ": double bits differ";
-    }
-    if (a.kind() == Value::Kind::Date && std::bit_cast<uint64_t>(a.date()->secondsSince1970) !=
-                                             std::bit_cast<uint64_t>(b.date()->secondsSince1970)) {
-        return ::testing::AssertionFailure() << at << ": date bits differ";
-    }
-    if (auto* x = a.arrayValue()) {
-        auto* y = b.arrayValue();
-        if (x->size() != y->size()) return ::testing::AssertionFailure() << at << ": array size";
-        for (size_t i = 0; i < x->size(); ++i) {
-            auto r = identical((*x)[i], (*y)[i], at + std::to_string(i) + "/");
-            if (!r) return r;
-        }
-        return ::testing::AssertionSuccess();
-    }
-    if (auto* x = a.dictionaryValue()) {
-        auto* y = b.dictionaryValue();
-        if (x->size() != y->size()) return ::testing::AssertionFailure() << at << ": dict size";
-        for (const auto& [key, element] : *x) {
-            const Value* other = b.find(key);
-            if (!other) return ::testing::AssertionFailure() << at << ": missing " << key;
-            auto r = identical(element, *other, at + key + "/");
-            if (!r) return r;
-        }
-        return ::testing::AssertionSuccess();
-    }
-    if (a.kind() == Value::Kind::Double || a.kind() == Value::Kind::Date) {
-        return ::testing::AssertionSuccess();
-    }
-    if (a == b) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure()
-           << at << ": " << a.description() << " vs " << b.description();
-}
+using test::identical;
 
 Bytes encode(const Value& v) {
     Bytes out;

@@ -4,17 +4,10 @@
 #include "platform/RunLoop.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <atomic>
-#include <cerrno>
-#include <chrono>
-#include <condition_variable>
 #include <cstring>
-#include <mutex>
-#include <thread>
-#include <vector>
+
+#include "TestSupport.h"
 
 namespace berth {
 namespace {
@@ -37,50 +30,24 @@ struct Pipe {
     UniqueFd write;
 };
 
-// Stops `loop` from another thread after a while, so a test that expects the
-// loop to stop by itself fails instead of hanging when it does not.
-class Watchdog {
-  public:
-    explicit Watchdog(RunLoop& loop)
-        : thread_([this, &loop] {
-              std::unique_lock lock(mutex_);
-              if (!done_.wait_for(lock, 60s, [&] { return finished_; })) {
-                  fired_ = true;
-                  loop.stop();
-              }
-          }) {}
-    ~Watchdog() {
-        {
-            std::lock_guard lock(mutex_);
-            finished_ = true;
-            done_.notify_all();
+// Runs `loop` until it stops. A watchdog stops it after a while, so a test
+// that expects the loop to stop by itself fails instead of hanging.
+void runGuarded(RunLoop& loop) {
+    test::Event done;
+    std::atomic<bool> fired{false};
+    std::thread watchdog([&] {
+        if (!done.wait(60s)) {
+            fired = true;
+            loop.stop();
         }
-        thread_.join();
-        EXPECT_FALSE(fired_) << "the run loop had to be stopped by the watchdog";
-    }
+    });
+    loop.run();
+    done.set();
+    watchdog.join();
+    EXPECT_FALSE(fired.load()) << "the run loop had to be stopped by the watchdog";
+}
 
-  private:
-    std::mutex mutex_;
-    std::condition_variable done_;
-    bool finished_ = false;
-    bool fired_ = false;
-    std::thread thread_;
-};
-
-// A death test whose statement would hang if the fault were not detected:
-// the alarm ends the child then, and the test fails instead of hanging.
-#define EXPECT_DEATH_BOUNDED(statement, regex) \
-    EXPECT_DEATH(                              \
-        {                                      \
-            ::alarm(30);                       \
-            statement;                         \
-        },                                     \
-        regex)
-
-class RunLoopDeathTest : public testing::Test {
-  protected:
-    void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-};
+using RunLoopDeathTest = test::ThreadsafeDeathTest;
 
 TEST(RunLoopTest, RunsItsQueueInOrderOnItsThreadUntilStopped) {
     RunLoop loop;
@@ -97,18 +64,12 @@ TEST(RunLoopTest, RunsItsQueueInOrderOnItsThreadUntilStopped) {
     loop.queue()->async(record(2));
     loop.queue()->async([&] { loop.stop(); });
     loop.queue()->async(record(3));
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     // The item after the stop waits for the next run.
     EXPECT_EQ(order, (std::vector<int>{1, 2}));
 
     loop.queue()->async([&] { loop.stop(); });
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
     EXPECT_TRUE(allOnLoopThread);
 }
@@ -138,10 +99,7 @@ TEST(RunLoopTest, WorkFromOtherThreadsAndTheirSyncsRunOnTheLoop) {
         for (auto& s : submitters) s.join();
         loop.queue()->async([&] { loop.stop(); });
     });
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     stopper.join();
     EXPECT_EQ(count, kThreads * kPerThread);
     EXPECT_FALSE(offThread.load());
@@ -150,8 +108,7 @@ TEST(RunLoopTest, WorkFromOtherThreadsAndTheirSyncsRunOnTheLoop) {
 TEST(RunLoopTest, StopBeforeRunMakesTheNextRunReturn) {
     RunLoop loop;
     loop.stop();
-    Watchdog watchdog(loop);
-    loop.run();  // returns at once instead of waiting for work
+    runGuarded(loop);  // returns at once instead of waiting for work
 }
 
 TEST(RunLoopTest, ReadinessIsDeliveredOnTheQueueUntilTheDataIsRead) {
@@ -171,10 +128,7 @@ TEST(RunLoopTest, ReadinessIsDeliveredOnTheQueueUntilTheDataIsRead) {
     ASSERT_NE(id, 0u);
 
     std::thread writer([&] { pipe.put("abc"); });
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     writer.join();
     EXPECT_EQ(received, (std::vector<char>{'a', 'b', 'c'}));
     EXPECT_TRUE(onLoopThread);
@@ -184,10 +138,7 @@ TEST(RunLoopTest, ReadinessIsDeliveredOnTheQueueUntilTheDataIsRead) {
     EXPECT_FALSE(loop.unwatch(id));
     pipe.put("d");
     loop.queue()->async([&] { loop.stop(); });
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     EXPECT_EQ(received.size(), 3u);
 
     errno = 0;
@@ -215,10 +166,7 @@ TEST(RunLoopTest, SuspendedQueueHoldsReadinessBack) {
         callsWhileSuspended = calls.load();
         loop.queue()->resume();
     });
-    {
-        Watchdog watchdog(loop);
-        loop.run();
-    }
+    runGuarded(loop);
     resumer.join();
     EXPECT_EQ(callsWhileSuspended.load(), 0);
     EXPECT_EQ(calls.load(), 1);

@@ -1,50 +1,15 @@
 #include "core/ValueJson.h"
 
-#include <gtest/gtest.h>
-
-#include <bit>
 #include <cmath>
 #include <limits>
 
+#include "TestSupport.h"
 #include "core/RelayCodec.h"
 
 namespace berth {
 namespace {
 
-// Kind and bits must match too, which Value's == ignores for integers.
-::testing::AssertionResult identical(const Value& a, const Value& b) {
-    if (a.kind() != b.kind()) {
-        return ::testing::AssertionFailure()
-               << a.description() << " (" << kindName(a.kind()) << ") vs " << b.description()
-               << " (" << kindName(b.kind()) << ")";
-    }
-    if (a.kind() == Value::Kind::Double) {
-        if (std::bit_cast<uint64_t>(*a.doubleValue()) == std::bit_cast<uint64_t>(*b.doubleValue()))
-            return ::testing::AssertionSuccess();
-        return ::testing::AssertionFailure() << *a.doubleValue() << " vs " << *b.doubleValue();
-    }
-    if (auto* x = a.arrayValue()) {
-        if (x->size() != b.size()) return ::testing::AssertionFailure() << "array sizes differ";
-        for (size_t i = 0; i < x->size(); ++i) {
-            auto r = identical((*x)[i], (*b.arrayValue())[i]);
-            if (!r) return r << " at [" << i << "]";
-        }
-        return ::testing::AssertionSuccess();
-    }
-    if (auto* x = a.dictionaryValue()) {
-        if (x->size() != b.size())
-            return ::testing::AssertionFailure() << "dictionary sizes differ";
-        for (const auto& [key, element] : *x) {
-            const Value* other = b.find(key);
-            if (!other) return ::testing::AssertionFailure() << "missing key " << key;
-            auto r = identical(element, *other);
-            if (!r) return r << " at key " << key;
-        }
-        return ::testing::AssertionSuccess();
-    }
-    if (a == b) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure() << a.description() << " vs " << b.description();
-}
+using test::identical;
 
 Value parse(const std::string& text) {
     std::string error;

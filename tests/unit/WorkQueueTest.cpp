@@ -7,64 +7,23 @@
 // NOT happen give a broken queue a short while to misbehave first.
 #include "platform/WorkQueue.h"
 
-#include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
-#include <unistd.h>
 
-#include <atomic>
-#include <chrono>
-#include <condition_variable>
-#include <functional>
-#include <mutex>
-#include <stdexcept>
-#include <thread>
 #include <tuple>
-#include <vector>
+
+#include "TestSupport.h"
 
 namespace berth {
 namespace {
 
 using namespace std::chrono_literals;
+using test::Event;
+using test::eventually;
 
-constexpr auto kDeadline = 60s;
-// How long a deliberately blocked item waits for its release. Longer than
-// kDeadline, so a check that waits for other work to get past blocked items
-// fails before the blocked items give up by themselves.
+// How long a deliberately blocked item waits for its release: longer than
+// any wait of a check, so such a check fails before the items give up.
 constexpr std::chrono::milliseconds kBlocked = 10min;
-
-// A one-shot signal between threads.
-class Event {
-  public:
-    void set() {
-        std::lock_guard lock(mutex_);
-        set_ = true;
-        changed_.notify_all();
-    }
-    bool isSet() const {
-        std::lock_guard lock(mutex_);
-        return set_;
-    }
-    // False when the deadline passed first.
-    bool wait(std::chrono::milliseconds deadline = kDeadline) {
-        std::unique_lock lock(mutex_);
-        return changed_.wait_for(lock, deadline, [this] { return set_; });
-    }
-
-  private:
-    mutable std::mutex mutex_;
-    std::condition_variable changed_;
-    bool set_ = false;
-};
-
-bool eventually(const std::function<bool()>& condition) {
-    const auto end = std::chrono::steady_clock::now() + kDeadline;
-    while (!condition()) {
-        if (std::chrono::steady_clock::now() > end) return false;
-        std::this_thread::sleep_for(1ms);
-    }
-    return true;
-}
 
 // Time for a faulty queue to run something it should not.
 void giveChanceToMisbehave() {
@@ -93,20 +52,7 @@ int currentNice() {
     return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)));
 }
 
-// A death test whose statement would hang if the fault were not detected:
-// the alarm ends the child then, and the test fails instead of hanging.
-#define EXPECT_DEATH_BOUNDED(statement, regex) \
-    EXPECT_DEATH(                              \
-        {                                      \
-            ::alarm(30);                       \
-            statement;                         \
-        },                                     \
-        regex)
-
-class WorkQueueDeathTest : public testing::Test {
-  protected:
-    void SetUp() override { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
-};
+using WorkQueueDeathTest = test::ThreadsafeDeathTest;
 
 TEST(WorkQueueTest, SerialQueueRunsOneItemAtATimeInSubmissionOrder) {
     auto queue = WorkQueue::makeSerial("test.serial");
