@@ -1,14 +1,8 @@
 #include "BTHGlobalConfiguration.h"
 
-#include "BTHContainerClass.h"
-
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-
-#include <set>
-#include <thread>
-
 #include <sys/xattr.h>
+
+#include "BTHContainerClass.h"
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
 
@@ -21,11 +15,7 @@ const std::filesystem::path& root() {
 }
 const bool kRootInstalled = !root().empty();
 
-struct stat statOf(const std::filesystem::path& path) {
-    struct stat st {};
-    EXPECT_EQ(::lstat(path.c_str(), &st), 0) << path;
-    return st;
-}
+using test::lstatOf;
 
 // The protection class stored on the item itself (not inherited), or -1.
 int32_t storedProtectionClass(const std::filesystem::path& path) {
@@ -37,7 +27,7 @@ int32_t storedProtectionClass(const std::filesystem::path& path) {
 }
 
 void expectDirectory(const std::filesystem::path& path, uid_t owner) {
-    struct stat st = statOf(path);
+    const struct stat st = lstatOf(path);
     EXPECT_TRUE(S_ISDIR(st.st_mode)) << path;
     EXPECT_EQ(st.st_mode & 07777, 0755u) << path;
     EXPECT_EQ(st.st_uid, owner) << path;
@@ -75,37 +65,33 @@ TEST_F(BTHGlobalConfigurationTest, TransientBundleDirectoryBelongsToTheBundleUse
 }
 
 TEST_F(BTHGlobalConfigurationTest, ClassDirectoriesForEveryKindOfClass) {
-    auto perUser =
-        config().containerDirectoryURLForUser(501, BTHContainerClassDataApplication, false);
-    ASSERT_TRUE(perUser);
-    EXPECT_EQ(*perUser, root() / "private/var/mobile/Containers/Data/Application");
-    expectDirectory(*perUser, 501);
-    EXPECT_EQ(statOf(*perUser).st_gid, 501u);
-    expectDirectory(perUser->parent_path().parent_path(), 501);
-
     // Global classes ignore the user they are asked for.
-    auto bundle =
-        config().containerDirectoryURLForUser(501, BTHContainerClassBundleApplication, false);
-    ASSERT_TRUE(bundle);
-    EXPECT_EQ(*bundle, root() / "private/var/containers/Bundle/Application");
-    expectDirectory(*bundle, kBTHBundleUserId);
-
-    auto system = config().containerDirectoryURLForUser(0, BTHContainerClassDataSystem, true);
-    ASSERT_TRUE(system);
-    EXPECT_EQ(*system, root() / "private/var/root/Library/Caches/sys.kelp.berthd/Temp/Data/System");
-    expectDirectory(*system, 0);
-
-    auto transientBundle =
-        config().containerDirectoryURLForUser(33, BTHContainerClassBundleFramework, true);
-    ASSERT_TRUE(transientBundle);
-    EXPECT_EQ(*transientBundle, config().transientBundleDirectory() / "Bundle/Framework");
-
-    auto transientUser =
-        config().containerDirectoryURLForUser(502, BTHContainerClassDataTempDir, true);
-    ASSERT_TRUE(transientUser);
-    EXPECT_EQ(*transientUser,
-              root() / "private/var/other/Library/Caches/sys.kelp.berthd/Temp/Data/TempDir");
-    expectDirectory(*transientUser, 502);
+    const struct {
+        uid_t user;
+        uint64_t containerClass;
+        bool transient;
+        std::filesystem::path expected;
+        uid_t owner;
+    } cases[] = {
+        {501, BTHContainerClassDataApplication, false,
+         root() / "private/var/mobile/Containers/Data/Application", 501},
+        {501, BTHContainerClassBundleApplication, false,
+         root() / "private/var/containers/Bundle/Application", kBTHBundleUserId},
+        {0, BTHContainerClassDataSystem, true,
+         root() / "private/var/root/Library/Caches/sys.kelp.berthd/Temp/Data/System", 0},
+        {33, BTHContainerClassBundleFramework, true,
+         config().transientBundleDirectory() / "Bundle/Framework", kBTHBundleUserId},
+        {502, BTHContainerClassDataTempDir, true,
+         root() / "private/var/other/Library/Caches/sys.kelp.berthd/Temp/Data/TempDir", 502},
+    };
+    for (const auto& c : cases) {
+        auto url = config().containerDirectoryURLForUser(c.user, c.containerClass, c.transient);
+        ASSERT_TRUE(url) << c.expected;
+        EXPECT_EQ(*url, c.expected);
+        expectDirectory(*url, c.owner);
+    }
+    EXPECT_EQ(lstatOf(cases[0].expected).st_gid, 501u);
+    expectDirectory(cases[0].expected.parent_path().parent_path(), 501);
 
     for (uint64_t invalid : {0, 14, 15}) {
         EXPECT_FALSE(config().containerDirectoryURLForUser(501, invalid, false)) << invalid;
@@ -169,12 +155,10 @@ TEST_F(BTHGlobalConfigurationTest, PerUserPathsAndTheClassCheck) {
 TEST_F(BTHGlobalConfigurationTest, ConcurrentFirstRequestsShareOneConfiguration) {
     std::vector<std::shared_ptr<BTHPerUserConfiguration>> got(16);
     std::vector<std::thread> threads;
-    for (size_t i = 0; i < got.size(); ++i)
-        threads.emplace_back([&, i] { got[i] = config().getPerUserConfigurationForUserId(502); });
+    for (auto& g : got)
+        threads.emplace_back([&] { g = config().getPerUserConfigurationForUserId(502); });
     for (auto& t : threads) t.join();
-    std::set<BTHPerUserConfiguration*> distinct;
-    for (auto& g : got) distinct.insert(g.get());
-    EXPECT_EQ(distinct.size(), 1u);
+    for (auto& g : got) EXPECT_EQ(g, got[0]);
 }
 
 TEST_F(BTHGlobalConfigurationTest, MigrationFilesAndUserEnumeration) {

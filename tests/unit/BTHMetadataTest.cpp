@@ -1,10 +1,5 @@
 #include "BTHMetadata.h"
 
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <csignal>
 
 #include "BTHPropertyListFile.h"
@@ -15,8 +10,7 @@ namespace berth {
 namespace {
 
 namespace fs = std::filesystem;
-using test::LogCapture;
-using test::ScratchDir;
+using namespace test;
 
 constexpr const char* kReadName =
     "+[BTHMetadata readAndValidateMetadataAtUrl:forUser:checkClassPath:error:]";
@@ -34,15 +28,13 @@ class BTHMetadataTest : public ::testing::Test {
 
     // The file of a valid per-user data container of user 501.
     static Value validFile() {
-        Value dict = Value::dictionary();
-        dict.set(kBTHMetadataIdentifierKey, "com.example.app");
-        dict.set(kBTHMetadataUUIDKey, kUuid.string());
-        dict.set(kBTHMetadataContentClassKey, uint64_t{2});
-        dict.set(kBTHMetadataPersonaKey, uint32_t{501});
-        return dict;
+        return dict({{kBTHMetadataIdentifierKey, "com.example.app"},
+                     {kBTHMetadataUUIDKey, kUuid.string()},
+                     {kBTHMetadataContentClassKey, uint64_t{2}},
+                     {kBTHMetadataPersonaKey, uint32_t{501}}});
     }
 
-    static void writeFile(const fs::path& container, const Value& dict) {
+    static void writeMetadata(const fs::path& container, const Value& dict) {
         BTHErrorRef error;
         ASSERT_TRUE(BTH_writeToURL(dict, BTHMetadata::metadataFileURL(container),
                                    kBTHStateFileWriteOptions, &error))
@@ -80,12 +72,11 @@ class BTHMetadataTest : public ::testing::Test {
 
 TEST_F(BTHMetadataTest, WriteThenReadGivesTheSameRecordWithExactlyTheDefinedKeys) {
     const fs::path url = makeContainer("Data/Application");
-    Value nested = Value::dictionary();
-    nested.set("list", Value(Value::Array{Value(int64_t{-3}), Value("x"), Value(true)}));
-    nested.set("blob", Value(Value::Data{0, 1, 0xff}));
-    Value info = Value::dictionary();
-    info.set("sys.kelp.Lading.ContentProtectionClass", int32_t{3});
-    info.set("nested", nested);
+    const Value info =
+        dict({{"sys.kelp.Lading.ContentProtectionClass", int32_t{3}},
+              {"nested",
+               dict({{"list", Value(Value::Array{Value(int64_t{-3}), Value("x"), Value(true)})},
+                     {"blob", Value(Value::Data{0, 1, 0xff})}})}});
     BTHMetadata written(501, kUuid, 2, "com.example.app", info, url, "Assets");
     ASSERT_TRUE(written.writeMetadataToDisk(nullptr));
 
@@ -94,7 +85,7 @@ TEST_F(BTHMetadataTest, WriteThenReadGivesTheSameRecordWithExactlyTheDefinedKeys
     ASSERT_NE(read, nullptr);
     EXPECT_EQ(*read, written);
 
-    EXPECT_EQ(test::readFile(BTHMetadata::metadataFileURL(url)).substr(0, 8), "bplist00");
+    EXPECT_EQ(readFile(BTHMetadata::metadataFileURL(url)).substr(0, 8), "bplist00");
     Value expected = validFile();  // its UUID string is upper-case
     expected.set(kBTHMetadataInfoKey, info);
     expected.set(kBTHMetadataUserManagedAssetsDirNameKey, "Assets");
@@ -147,7 +138,7 @@ TEST_F(BTHMetadataTest, InvalidValuesFailWithTheirOwnMessages) {
             dict.erase(c.key);
         else
             dict.set(c.key, c.value);
-        writeFile(url, dict);
+        writeMetadata(url, dict);
         expectReadFailure(url, 501, true, BTHErrorMetadataInvalid, c.message);
     }
 }
@@ -180,11 +171,11 @@ TEST_F(BTHMetadataTest, AFileWrongInSeveralWaysReportsTheEarliestCheck) {
     for (const Step& s : steps) dict.set(s.key, s.bad);
     for (const Step& s : steps) {
         SCOPED_TRACE(s.message);
-        writeFile(url, dict);
+        writeMetadata(url, dict);
         expectReadFailure(url, 501, true, BTHErrorMetadataInvalid, s.message);
         dict.set(s.key, s.good);
     }
-    writeFile(url, dict);
+    writeMetadata(url, dict);
     expectReadFailure(url, 501, true, BTHErrorMetadataInvalid,
                       "Invalid metadata-URLs should match: " + url.string() + " : " +
                           (scratch_.path() / "Containers/Data/Application").string());
@@ -201,10 +192,10 @@ TEST_F(BTHMetadataTest, UnreadableFilesFailWithTheReadError) {
     const std::optional<std::vector<uint8_t>> array =
         plist::serializeBinary(Value(Value::Array{validFile()}));
     ASSERT_TRUE(array);
-    test::writeFile(file, std::string(array->begin(), array->end()));
+    writeFile(file, std::string(array->begin(), array->end()));
     expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);
 
-    test::writeFile(file, "bplist00 this is not a property list");
+    writeFile(file, "bplist00 this is not a property list");
     expectReadFailure(url, 501, true, BTHErrorMetadataReadFailed, message);
 
     fs::remove(file);
@@ -213,33 +204,27 @@ TEST_F(BTHMetadataTest, UnreadableFilesFailWithTheReadError) {
 }
 
 TEST_F(BTHMetadataTest, APipeInTheFilesPlaceDoesNotBlockTheReader) {
-    // An app can put a pipe where its container's file belongs; the read must
-    // fail at once rather than wait for a writer. It runs in a child whose
-    // alarm ends it if it blocks, so a stuck reader fails this test instead of
-    // hanging the suite.
+    // An app can put a pipe where its container's file belongs: the read must
+    // fail at once, not wait for a writer. A stuck child is ended by its alarm.
     const fs::path url = makeContainer("Data/Application");
     ASSERT_EQ(::mkfifo(BTHMetadata::metadataFileURL(url).c_str(), 0644), 0);
-    const pid_t child = ::fork();
-    ASSERT_GE(child, 0);
-    if (child == 0) {
+    const int status = inChild([&] {
         ::alarm(10);
         BTHErrorRef error;
-        bool unreadable = !BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, &error) &&
-                          error && error->isBTHError(BTHErrorMetadataReadFailed);
-        ::_exit(unreadable ? 0 : 1);
-    }
-    int status = 0;
-    ASSERT_EQ(::waitpid(child, &status, 0), child);
-    EXPECT_FALSE(WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM)
-        << "the reader blocked opening a pipe";
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+        return !BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, &error) && error &&
+                       error->isBTHError(BTHErrorMetadataReadFailed)
+                   ? 0
+                   : 1;
+    });
+    EXPECT_NE(status, 128 + SIGALRM) << "the reader blocked opening a pipe";
+    EXPECT_EQ(status, 0);
 }
 
 TEST_F(BTHMetadataTest, SymbolicLinksAreNeverFollowed) {
     // A valid file elsewhere, reached through a link in the metadata file's
     // place or in the container's path, must not be read.
     const fs::path real = makeContainer("Data/Application");
-    writeFile(real, validFile());
+    writeMetadata(real, validFile());
     ASSERT_NE(BTHMetadata::readAndValidateMetadataAtUrl(real, 501, true, nullptr), nullptr);
 
     const fs::path linkedFile = makeContainer("Data/Application");
@@ -258,7 +243,7 @@ TEST_F(BTHMetadataTest, AMissingUserIsDefaultedForThisReadOnly) {
     const fs::path data = makeContainer("Data/Application");
     Value dict = validFile();
     dict.erase(kBTHMetadataPersonaKey);
-    writeFile(data, dict);
+    writeMetadata(data, dict);
     for (uid_t user : {501u, 502u}) {
         std::shared_ptr<BTHMetadata> read =
             BTHMetadata::readAndValidateMetadataAtUrl(data, user, true, nullptr);
@@ -269,14 +254,14 @@ TEST_F(BTHMetadataTest, AMissingUserIsDefaultedForThisReadOnly) {
 
     const fs::path bundle = makeContainer("Bundle/Application");
     dict.set(kBTHMetadataContentClassKey, uint64_t{1});
-    writeFile(bundle, dict);
+    writeMetadata(bundle, dict);
     std::shared_ptr<BTHMetadata> read =
         BTHMetadata::readAndValidateMetadataAtUrl(bundle, 33, true, nullptr);
     ASSERT_NE(read, nullptr);
     EXPECT_EQ(read->uid(), 33u);
 
     dict.set(kBTHMetadataPersonaKey, uint32_t{501});
-    writeFile(bundle, dict);
+    writeMetadata(bundle, dict);
     expectReadFailure(
         bundle, 33, true, BTHErrorMetadataInvalid,
         "Incorrect UserId: 501, expecting: 33 for com.example.app at " + bundle.string());
@@ -284,7 +269,7 @@ TEST_F(BTHMetadataTest, AMissingUserIsDefaultedForThisReadOnly) {
 
 TEST_F(BTHMetadataTest, TheClassPathIsComparedAsPathStrings) {
     const fs::path url = makeContainer("Data/Application");
-    writeFile(url, validFile());
+    writeMetadata(url, validFile());
     // A trailing slash names the same container.
     fs::path slashed = url.string() + "/";
     EXPECT_NE(BTHMetadata::readAndValidateMetadataAtUrl(slashed, 501, true, nullptr), nullptr);
@@ -292,7 +277,7 @@ TEST_F(BTHMetadataTest, TheClassPathIsComparedAsPathStrings) {
     // A container made inside another container is not in a class directory.
     const fs::path nested = url / Uuid::random().string();
     fs::create_directory(nested);
-    writeFile(nested, validFile());
+    writeMetadata(nested, validFile());
     expectReadFailure(nested, 501, true, BTHErrorMetadataInvalid,
                       "Invalid metadata-URLs should match: " + nested.string() + " : " +
                           (scratch_.path() / "Containers/Data/Data/Application").string());
@@ -300,7 +285,7 @@ TEST_F(BTHMetadataTest, TheClassPathIsComparedAsPathStrings) {
 
 TEST_F(BTHMetadataTest, XMLFilesAreReadLikeBinaryOnes) {
     const fs::path url = makeContainer("Data/Application");
-    test::writeFile(BTHMetadata::metadataFileURL(url), R"(<?xml version="1.0" encoding="UTF-8"?>
+    writeFile(BTHMetadata::metadataFileURL(url), R"(<?xml version="1.0" encoding="UTF-8"?>
 <!DOCTYPE plist>
 <plist version="1.0">
 <dict>
@@ -316,8 +301,7 @@ TEST_F(BTHMetadataTest, XMLFilesAreReadLikeBinaryOnes) {
     std::shared_ptr<BTHMetadata> read =
         BTHMetadata::readAndValidateMetadataAtUrl(url, 501, true, nullptr);
     ASSERT_NE(read, nullptr);
-    Value info = Value::dictionary();
-    info.set("k", Value(Value::Array{Value(true), Value(int64_t{-4})}));
+    const Value info = dict({{"k", Value(Value::Array{Value(true), Value(int64_t{-4})})}});
     EXPECT_EQ(*read, BTHMetadata(501, kUuid, 2, "com.example.app", info, url, std::nullopt));
 }
 
@@ -341,9 +325,7 @@ TEST_F(BTHMetadataTest, AFailedWriteIsReportedAndLeavesNoFile) {
     const fs::path url = makeContainer("Data/Application");
     record.setUrl(url);
     ASSERT_TRUE(record.writeMetadataToDisk(nullptr));
-    Value info = Value::dictionary();
-    info.set("id", Uuid::random());
-    record.setInfo(info);
+    record.setInfo(dict({{"id", Uuid::random()}}));
     error.reset();
     EXPECT_FALSE(record.writeMetadataToDisk(&error));
     EXPECT_TRUE(error && error->isBTHError(BTHErrorWriteFailed) && error->underlyingError());

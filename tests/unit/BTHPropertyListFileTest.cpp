@@ -1,12 +1,6 @@
 #include "BTHPropertyListFile.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <set>
 
 #include "TestSupport.h"
 #include "platform/UniqueFd.h"
@@ -15,20 +9,13 @@ namespace berth {
 namespace {
 
 namespace stdfs = std::filesystem;
-using test::ScratchDir;
+using namespace test;
+const auto entries = namesIn;
 
 Value state(const char* identifier) {
-    Value v = Value::dictionary();
-    v.set("BTHMetadataIdentifier", identifier);
-    v.set("BTHMetadataContentClass", uint64_t{2});
-    v.set("BTHMetadataPersona", uint32_t{501});
-    return v;
-}
-
-std::set<std::string> entries(const stdfs::path& dir) {
-    std::set<std::string> names;
-    for (const auto& e : stdfs::directory_iterator(dir)) names.insert(e.path().filename());
-    return names;
+    return dict({{"BTHMetadataIdentifier", identifier},
+                 {"BTHMetadataContentClass", uint64_t{2}},
+                 {"BTHMetadataPersona", uint32_t{501}}});
 }
 
 bool isGeneralCorrupt(const BTHErrorRef& e) {
@@ -44,11 +31,11 @@ TEST(BTHPropertyListFileTest, AtomicWriteReplacesTheFileWholeAndLeavesNothingBeh
     const stdfs::path file = dir / "state.plist";
     BTHErrorRef error;
     ASSERT_TRUE(BTH_writeToURL(state("one"), file, kBTHStateFileWriteOptions, &error));
-    EXPECT_EQ(test::readFile(file).substr(0, 8), "bplist00");
+    EXPECT_EQ(readFile(file).substr(0, 8), "bplist00");
 
     // A reader that opened the old file keeps seeing it whole: the new one
     // is renamed over it, never written into it.
-    const std::string before = test::readFile(file);
+    const std::string before = readFile(file);
     UniqueFd old(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
     ASSERT_TRUE(BTH_writeToURL(state("two"), file, kBTHStateFileWriteOptions, &error));
     std::string seen(before.size(), '\0');
@@ -64,7 +51,7 @@ TEST(BTHPropertyListFileTest, FailedWritesKeepTheOldFileAndRemoveTheirTemporary)
     // The rename fails when a directory holds the name: the temporary file
     // was already written and must go again.
     stdfs::create_directory(dir / "busy");
-    test::writeFile(dir / "busy" / "inside", "x");
+    writeFile(dir / "busy" / "inside", "x");
     BTHErrorRef error;
     EXPECT_FALSE(BTH_writeToURL(state("a"), dir / "busy", kBTHStateFileWriteOptions, &error));
     ASSERT_TRUE(error);
@@ -87,13 +74,12 @@ TEST(BTHPropertyListFileTest, WriteIntoAnUnwritableDirectoryKeepsTheOldFile) {
     ScratchDir dir;
     const stdfs::path file = dir / "state.plist";
     ASSERT_TRUE(BTH_writeToURL(state("old"), file, kBTHStateFileWriteOptions, nullptr));
-    ASSERT_TRUE(test::setImmutable(dir.path(), true));
+    ASSERT_TRUE(setImmutable(dir.path(), true));
     BTHErrorRef error;
     const bool wrote = BTH_writeToURL(state("new"), file, kBTHStateFileWriteOptions, &error);
-    test::setImmutable(dir.path(), false);
+    setImmutable(dir.path(), false);
     EXPECT_FALSE(wrote);
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(EPERM)) << error->description();
+    expectPOSIXError(error, EPERM);
     EXPECT_EQ(*read(file, nullptr), state("old"));
     EXPECT_EQ(entries(dir.path()), std::set<std::string>{"state.plist"});
 }
@@ -104,7 +90,7 @@ TEST(BTHPropertyListFileTest, SymbolicLinksAreNeverFollowed) {
     stdfs::create_directory_symlink(dir / "real", dir / "linked");
     const stdfs::path target = dir / "real" / "state.plist";
     ASSERT_TRUE(BTH_writeToURL(state("target"), target, kBTHStateFileWriteOptions, nullptr));
-    const std::string original = test::readFile(target);
+    const std::string original = readFile(target);
 
     // A linked directory refuses both reading and writing.
     BTHErrorRef error;
@@ -116,43 +102,40 @@ TEST(BTHPropertyListFileTest, SymbolicLinksAreNeverFollowed) {
     EXPECT_FALSE(stdfs::exists(dir / "real" / "other.plist"));
     error.reset();
     EXPECT_FALSE(read(dir / "linked" / "state.plist", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ELOOP));
+    expectPOSIXError(error, ELOOP);
 
     // A link in the file's place is not read through; a write replaces the
     // link itself and leaves its target alone.
     stdfs::create_symlink(target, dir / "link.plist");
     error.reset();
     EXPECT_FALSE(read(dir / "link.plist", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ELOOP));
+    expectPOSIXError(error, ELOOP);
     ASSERT_TRUE(
         BTH_writeToURL(state("mine"), dir / "link.plist", kBTHStateFileWriteOptions, nullptr));
     EXPECT_FALSE(stdfs::is_symlink(dir / "link.plist"));
-    EXPECT_EQ(test::readFile(target), original);
+    EXPECT_EQ(readFile(target), original);
 }
 
 TEST(BTHPropertyListFileTest, ReadGivesTheReadErrorOrTheFormatError) {
     ScratchDir dir;
     BTHErrorRef error;
     EXPECT_FALSE(read(dir / "missing.plist", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIXError(ENOENT));
+    expectPOSIXError(error, ENOENT);
 
-    test::writeFile(dir / "state.xml",
-                    "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict>"
-                    "<key>BTHMetadataIdentifier</key><string>one</string>"
-                    "<key>BTHMetadataContentClass</key><integer>2</integer>"
-                    "<key>BTHMetadataPersona</key><integer>501</integer></dict></plist>");
+    writeFile(dir / "state.xml",
+              "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict>"
+              "<key>BTHMetadataIdentifier</key><string>one</string>"
+              "<key>BTHMetadataContentClass</key><integer>2</integer>"
+              "<key>BTHMetadataPersona</key><integer>501</integer></dict></plist>");
     std::optional<Value> xml = read(dir / "state.xml", &error);
     ASSERT_TRUE(xml);
     EXPECT_EQ(*xml, state("one"));
 
     std::string deep = "<plist>";
     for (int i = 0; i < 100000; ++i) deep += "<array>";
-    test::writeFile(dir / "deep.plist", deep);
-    test::writeFile(dir / "array.plist", "<plist><array><string>a</string></array></plist>");
-    test::writeFile(dir / "garbage.plist", "bplist00 not really");
+    writeFile(dir / "deep.plist", deep);
+    writeFile(dir / "array.plist", "<plist><array><string>a</string></array></plist>");
+    writeFile(dir / "garbage.plist", "bplist00 not really");
     {
         UniqueFd big(::open((dir / "big.plist").c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
         ASSERT_EQ(::ftruncate(big.get(), 33 << 20), 0);  // sparse; refused before reading

@@ -1,11 +1,5 @@
 #include "BTHRequestIntake.h"
 
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <chrono>
-#include <thread>
-
 #include "BTHCommandTable.h"
 #include "BTHError.h"
 #include "ScratchDeviceRoot.h"
@@ -15,6 +9,7 @@ namespace berth {
 namespace {
 
 const bool kRoot = !test::installScratchDeviceRoot().empty();
+using test::dict;
 
 class FakeRequest final : public BTHRequest {
   public:
@@ -42,12 +37,6 @@ BTHPeerIdentity peerWith(std::optional<Value> entitlements, uid_t uid = 501) {
     return peer;
 }
 
-Value entitlements(std::initializer_list<std::pair<const char*, Value>> entries) {
-    Value d = Value::dictionary();
-    for (auto& [k, v] : entries) d.set(k, v);
-    return d;
-}
-
 // The reply error of `command` sent by `peer`, and how many replies went out.
 std::pair<uint64_t, int> run(const Value& message, const BTHPeerIdentity& peer) {
     auto request = std::make_shared<FakeRequest>(message, peer);
@@ -57,9 +46,7 @@ std::pair<uint64_t, int> run(const Value& message, const BTHPeerIdentity& peer) 
 }
 
 Value command(uint64_t n) {
-    Value m = Value::dictionary();
-    m.set("Command", n);
-    return m;
+    return dict({{"Command", n}});
 }
 
 // Commands that pass the entitlement check reach their handler; refused ones
@@ -88,13 +75,13 @@ TEST(BTHRequestIntakeTest, CallerWithoutEntitlementsReachesOnlyOpenCommands) {
 }
 
 TEST(BTHRequestIntakeTest, AllowedPassesEveryCommandAndOtherIdLookupOnlyTheOpenOnes) {
-    const auto allowed = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    const auto allowed = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     for (uint64_t c = 0; c < kBTHCommandCount; ++c) {
         if (c == 4) continue;  // replies later, from its completion (below)
         EXPECT_EQ(run(command(c), allowed).first, reachedHandler(c)) << c;
     }
 
-    const auto lookupOnly = peerWith(entitlements({{kBTHEntitlementOtherIdLookup, true}}));
+    const auto lookupOnly = peerWith(dict({{kBTHEntitlementOtherIdLookup, true}}));
     EXPECT_EQ(run(command(0), lookupOnly).first, reachedHandler(0));
     EXPECT_EQ(run(command(1), lookupOnly).first, BTHErrorNotEntitled);
     EXPECT_EQ(run(command(24), lookupOnly).first, BTHErrorNotEntitled);
@@ -110,28 +97,28 @@ TEST(BTHRequestIntakeTest, AllowedPassesEveryCommandAndOtherIdLookupOnlyTheOpenO
 }
 
 TEST(BTHRequestIntakeTest, SpecificEntitlementsAndTheWipeList) {
-    const auto migrator = peerWith(entitlements({{kBTHEntitlementDataMigration, true}}));
+    const auto migrator = peerWith(dict({{kBTHEntitlementDataMigration, true}}));
     EXPECT_EQ(run(command(24), migrator).first, reachedHandler(24));
     EXPECT_EQ(run(command(26), migrator).first, BTHErrorNotEntitled);
-    const auto falseValue = peerWith(entitlements({{kBTHEntitlementDataMigration, false}}));
+    const auto falseValue = peerWith(dict({{kBTHEntitlementDataMigration, false}}));
     EXPECT_EQ(run(command(24), falseValue).first, BTHErrorNotEntitled);
 
     test::LogCapture log;
     Value ids = Value::array();
     ids.push("sys.kelp.plugin.a");
     ids.push(7);  // not a string: not an identifier
-    auto wiper = peerWith(entitlements({{kBTHEntitlementWipeContainer, ids}}));
+    auto wiper = peerWith(dict({{kBTHEntitlementWipeContainer, ids}}));
     auto client = checkEntitlementsAndInitClientObject(wiper, kBTHEntitlementWipeContainer);
     ASSERT_TRUE(client);
     EXPECT_EQ(client->entitledWipeIdentifiers(), std::vector<std::string>{"sys.kelp.plugin.a"});
     EXPECT_FALSE(client->allowOtherIdLookup());
 
-    auto notArray = peerWith(entitlements({{kBTHEntitlementWipeContainer, true}}));
+    auto notArray = peerWith(dict({{kBTHEntitlementWipeContainer, true}}));
     EXPECT_FALSE(checkEntitlementsAndInitClientObject(notArray, kBTHEntitlementWipeContainer));
     EXPECT_TRUE(log.contains(3, "No entitled containers to wipe"));
 
     // ".allowed" passes the wipe command too, with no wipe identifiers.
-    auto allowedOnly = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    auto allowedOnly = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     client = checkEntitlementsAndInitClientObject(allowedOnly, kBTHEntitlementWipeContainer);
     ASSERT_TRUE(client);
     EXPECT_FALSE(client->entitledWipeIdentifiers());
@@ -139,7 +126,7 @@ TEST(BTHRequestIntakeTest, SpecificEntitlementsAndTheWipeList) {
 
 TEST(BTHRequestIntakeTest, CommandNumberChecks) {
     test::LogCapture log;
-    const auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    const auto peer = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     EXPECT_EQ(run(command(30), peer), std::make_pair(uint64_t{BTHErrorInvalidCommand}, 1));
     EXPECT_EQ(run(command((uint64_t{1} << 32) + 1), peer).first, BTHErrorInvalidCommand);
     EXPECT_EQ(run(command(UINT64_MAX), peer).first, BTHErrorInvalidCommand);
@@ -150,7 +137,7 @@ TEST(BTHRequestIntakeTest, CommandNumberChecks) {
 }
 
 TEST(BTHRequestIntakeTest, RequestsFromAProcessNoLongerBoundAreRefused) {
-    auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    auto peer = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     peer.processStillBound = false;
     EXPECT_EQ(run(command(0), peer), std::make_pair(uint64_t{BTHErrorNotEntitled}, 1));
 }
@@ -158,7 +145,7 @@ TEST(BTHRequestIntakeTest, RequestsFromAProcessNoLongerBoundAreRefused) {
 TEST(BTHRequestIntakeTest, AsynchronousCommandsReplyOnceFromWhicheverSideFinishes) {
     // Command 4 replies from its completion, once death row is empty; a
     // failed user check replies at once.
-    const auto peer = peerWith(entitlements({{kBTHEntitlementAllowed, true}}));
+    const auto peer = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     auto emptying = std::make_shared<FakeRequest>(command(4), peer);
     BTHProcessRequest(emptying);
     for (int i = 0; i < 500 && emptying->sent == 0; ++i)
@@ -173,32 +160,29 @@ TEST(BTHRequestIntakeTest, AsynchronousCommandsReplyOnceFromWhicheverSideFinishe
 
 TEST(BTHRequestIntakeTest, ValidateUserIdForEveryClassFamilyAndClient) {
     test::LogCapture log;
-    uint32_t effective = 0;
-    uint64_t error = 1;
-    // Bundle classes: only 33, whoever asks.
-    EXPECT_TRUE(validateUserId(33, 1, 0, &effective, &error));
-    EXPECT_EQ(effective, 33u);
-    for (uint32_t user : {0u, 1u, 501u})
-        EXPECT_FALSE(validateUserId(user, 1, 0, &effective, &error)) << user;
-    EXPECT_EQ(error, uint64_t{BTHErrorInvalidParameter});
+    // Bundle classes take only 33 and system classes only 499, whoever asks;
+    // a mobile client names only itself; for a system client 1 is the current
+    // mobile user, and others are valid only for per-user classes.
+    const struct {
+        uint32_t user;
+        uint64_t containerClass;
+        uint32_t client;
+        uint32_t effective;  // 0: refused
+    } cases[] = {{33, 1, 0, 33},      {0, 1, 0, 0},   {1, 1, 0, 0},     {501, 1, 0, 0},
+                 {499, 13, 501, 499}, {1, 12, 0, 0},  {1, 2, 501, 501}, {501, 7, 501, 501},
+                 {502, 2, 501, 0},    {0, 2, 501, 0}, {1, 2, 0, 501},   {502, 11, 0, 502},
+                 {502, 0, 0, 0},      {502, 14, 0, 0}};
+    for (const auto& c : cases) {
+        uint32_t effective = 0;
+        uint64_t error = 1;
+        EXPECT_EQ(validateUserId(c.user, c.containerClass, c.client, &effective, &error),
+                  c.effective != 0)
+            << c.user << " class " << c.containerClass << " from " << c.client;
+        EXPECT_EQ(c.effective ? effective : error,
+                  c.effective ? c.effective : uint64_t{BTHErrorInvalidParameter});
+    }
     EXPECT_TRUE(log.contains(3, "Invalid userId 501 for class 1 from client 0"));
-    // System classes: only 499.
-    EXPECT_TRUE(validateUserId(499, 13, 501, &effective, nullptr));
-    EXPECT_EQ(effective, 499u);
     EXPECT_FALSE(validateUserId(1, 12, 0, nullptr, nullptr));
-    // A mobile client names only itself.
-    EXPECT_TRUE(validateUserId(1, 2, 501, &effective, nullptr));
-    EXPECT_EQ(effective, 501u);
-    EXPECT_TRUE(validateUserId(501, 7, 501, &effective, nullptr));
-    EXPECT_FALSE(validateUserId(502, 2, 501, &effective, nullptr));
-    EXPECT_FALSE(validateUserId(0, 2, 501, &effective, nullptr));
-    // A system client: 1 is the current mobile user, others only for per-user classes.
-    EXPECT_TRUE(validateUserId(1, 2, 0, &effective, nullptr));
-    EXPECT_EQ(effective, 501u);
-    EXPECT_TRUE(validateUserId(502, 11, 0, &effective, nullptr));
-    EXPECT_EQ(effective, 502u);
-    EXPECT_FALSE(validateUserId(502, 0, 0, &effective, nullptr));
-    EXPECT_FALSE(validateUserId(502, 14, 0, &effective, nullptr));
     // Without an error location nothing is logged.
     size_t before = log.lines().size();
     EXPECT_FALSE(validateUserId(7, 1, 0, nullptr, nullptr));

@@ -65,10 +65,9 @@ TEST(RelayClientTest, ConnectsToTheDaemonOfTheDeviceRootOrToAnyPath) {
 }
 
 TEST(RelayClientTest, ALateReplyIsDroppedAndNeverAnswersTheNextRequest) {
-    std::promise<void> release;
-    std::shared_future<void> released = release.get_future().share();
+    test::Event release;
     RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
-        if (event.message().find("Slow")) released.wait();
+        if (event.message().find("Slow")) release.wait(std::chrono::minutes(10));
         reply.body().set("Echo", event.message());
     });
     BerthError error;
@@ -77,7 +76,7 @@ TEST(RelayClientTest, ALateReplyIsDroppedAndNeverAnswersTheNextRequest) {
 
     EXPECT_FALSE(connection->request(dictionaryWith("Slow", true), 100ms, &error));
     EXPECT_EQ(error.code, BerthError::Code::Timeout) << error.message;
-    release.set_value();
+    release.set();
     // Queued behind the slow one on the daemon, so its reply comes second.
     auto reply = connection->request(dictionaryWith("Fast", true), 20s, &error);
     ASSERT_TRUE(reply) << error.message;

@@ -99,14 +99,9 @@ TEST(RelayTest, ThreadsSharingAClientConnectionEachGetTheirOwnReply) {
 }
 
 TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
-    std::promise<void> release;
-    std::shared_future<void> released = release.get_future().share();
-    std::promise<void> blocking;
+    test::Event release, blocking;
     RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
-        if (event.message().find("Block")) {
-            blocking.set_value();
-            released.wait();
-        }
+        if (event.message().find("Block")) blocking.set(), release.wait(10min);
         reply.body().set("Seq", numberAt(event.message(), "Seq"));
     });
     auto slow = connectTo(server);
@@ -115,7 +110,7 @@ TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
 
     auto slowReply = std::async(std::launch::async,
                                 [&] { return slow->request(dictionaryWith("Block", true), 30s); });
-    blocking.get_future().wait();
+    ASSERT_TRUE(blocking.wait());
     // The blocked handler still runs; the other peer is served meanwhile.
     for (uint64_t seq = 0; seq < 20; ++seq) {
         BerthError error;
@@ -124,19 +119,14 @@ TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
         EXPECT_EQ(numberAt(*reply, "Seq"), seq);
     }
     EXPECT_EQ(slowReply.wait_for(0s), std::future_status::timeout);
-    release.set_value();
+    release.set();
     EXPECT_TRUE(slowReply.get());
 }
 
 TEST(RelayTest, APeerThatLeavesBeforeItsReplyCostsNothingButThatReply) {
-    std::promise<void> release;
-    std::shared_future<void> released = release.get_future().share();
-    std::promise<void> blocking;
-    RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
-        if (event.message().find("Block")) {
-            blocking.set_value();
-            released.wait();
-        }
+    test::Event release, blocking;
+    RelayTestServer server([&](const RelayEvent& event, RelayReply&) {
+        if (event.message().find("Block")) blocking.set(), release.wait(10min);
     });
     {
         UniqueFd leaving = server.connectRaw();
@@ -145,12 +135,12 @@ TEST(RelayTest, APeerThatLeavesBeforeItsReplyCostsNothingButThatReply) {
         // A second request that will never start: its peer is gone by then.
         ASSERT_TRUE(test::writeAll(
             leaving.get(), test::frameBytes(relay::FrameKind::Request, 2, Value::dictionary())));
-        blocking.get_future().wait();
+        ASSERT_TRUE(blocking.wait());
     }
     // The connection ends as soon as the peer is gone; the handler under way
     // finishes, its reply goes nowhere, and the request behind it never starts.
     ASSERT_TRUE(server.waitFor([&] { return server.listener().connectionCount() == 0; }));
-    release.set_value();
+    release.set();
     EXPECT_TRUE(server.waitFor([&] { return server.unsent() == 1 && server.invalidated() == 1; }));
 
     auto other = connectTo(server);
@@ -233,14 +223,13 @@ TEST(RelayTest, ABrokenFrameDropsItsConnectionAndNothingElse) {
 }
 
 TEST(RelayTest, AFloodingPeerIsHeldBackNotBufferedAndLosesNothing) {
-    std::promise<void> release;
-    std::shared_future<void> released = release.get_future().share();
+    test::Event release;
     RelayLimits limits;
     limits.maxQueuedRequests = 4;
     RelayTestServer server(
         [&](const RelayEvent& event, RelayReply& reply) {
             const uint64_t seq = numberAt(event.message(), "Seq");
-            if (seq == 0) released.wait();
+            if (seq == 0) release.wait(10min);
             reply.body().set("Seq", seq);
         },
         limits);
@@ -266,7 +255,7 @@ TEST(RelayTest, AFloodingPeerIsHeldBackNotBufferedAndLosesNothing) {
     }
     EXPECT_TRUE(heldBack) << "the server took all " << sent << " requests while stalled";
 
-    release.set_value();
+    release.set();
     ::fcntl(flooder.get(), F_SETFL, 0);
     std::vector<relay::Frame> replies = test::readFrames(flooder.get(), sent);
     ASSERT_EQ(replies.size(), sent);

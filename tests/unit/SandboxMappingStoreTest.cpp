@@ -1,14 +1,6 @@
 #include "platform/SandboxMappingStore.h"
 
-#include <gtest/gtest.h>
 #include <limits.h>
-#include <sys/stat.h>
-
-#include <atomic>
-#include <filesystem>
-#include <set>
-#include <thread>
-#include <vector>
 
 #include "TestSupport.h"
 
@@ -21,12 +13,7 @@ using namespace std::string_literals;
 constexpr uid_t kUser = 501;
 constexpr uint64_t kData = 1;
 
-std::set<std::string> namesIn(const stdfs::path& directory) {
-    std::set<std::string> names;
-    for (const auto& entry : stdfs::directory_iterator(directory))
-        names.insert(entry.path().filename());
-    return names;
-}
+using test::namesIn;
 
 class SandboxMappingStoreTest : public ::testing::Test {
   protected:
@@ -54,11 +41,8 @@ TEST_F(SandboxMappingStoreTest, SetLookUpReplaceAndRemove) {
     const stdfs::path link = entryDirectory(kUser, kData) / "a.app";
     EXPECT_TRUE(stdfs::is_symlink(link));
     for (const stdfs::path& d :
-         {store_.directory(), store_.directory() / "501", entryDirectory(kUser, kData)}) {
-        struct stat st {};
-        ASSERT_EQ(::lstat(d.c_str(), &st), 0) << d;
-        EXPECT_EQ(st.st_mode & 07777, 0755u) << d;
-    }
+         {store_.directory(), store_.directory() / "501", entryDirectory(kUser, kData)})
+        EXPECT_EQ(test::lstatOf(d).st_mode & 07777, 0755u) << d;
 
     // Entries are per user and per item type.
     EXPECT_FALSE(store_.lookup(502, kData, "a.app"));
