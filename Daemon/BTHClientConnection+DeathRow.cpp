@@ -81,6 +81,9 @@ bool BTHClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::pa
     const std::filesystem::path temp = DeviceRoot::resolve("/tmp");
     BTHErrorRef moveError;
     if (!fileManager.moveItemAtURL(url, temp / url.filename(), &moveError)) {
+        // Gone after all (the removal reported an item that later vanished).
+        if (moveError && moveError->isPOSIXError(ENOENT) && fileManager.itemDoesNotExistAtURL(url))
+            return true;
         BTHSetError(error, BTHMakeError(BTHErrorMoveAsideFailed, moveError,
                                         "Failed to move dir: %@ to: %@", url, "/tmp"));
         return false;

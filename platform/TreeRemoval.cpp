@@ -162,8 +162,14 @@ bool Remover::removeContents(int dirFd, int parentFd, const std::string& name,
             entries.push_back(Entry{entry->d_name, entry->d_type});
         if (errno != 0) return fail(parentFd, name, path, errno);
     }
-    for (const Entry& child : entries)
-        if (!removeEntry(dirFd, child.name, path / child.name, child.type, depth + 1)) return false;
+    for (const Entry& child : entries) {
+        // The common case, a file that goes at once, needs no path: paths are
+        // made only for items that take the careful route (and may fail).
+        if (child.type != DT_DIR && child.type != DT_UNKNOWN &&
+            ::unlinkat(dirFd, child.name.c_str(), 0) == 0)
+            continue;
+        if (!removeEntry(dirFd, child.name, path / child.name, DT_UNKNOWN, depth + 1)) return false;
+    }
     return true;
 }
 
