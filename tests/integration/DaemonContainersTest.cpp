@@ -4,9 +4,6 @@
 #include <acl/libacl.h>
 #include <sys/acl.h>
 
-#include <set>
-#include <thread>
-
 #include "BTHCodeSigningMapping.h"
 #include "BTHMetadata.h"
 #include "BTHPropertyListFile.h"

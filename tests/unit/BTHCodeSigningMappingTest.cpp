@@ -1,10 +1,6 @@
 #include "BTHCodeSigningMapping.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-
-#include <filesystem>
 
 #include "BTHPropertyListFile.h"
 #include "ScratchDeviceRoot.h"

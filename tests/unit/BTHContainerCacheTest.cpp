@@ -1,8 +1,5 @@
 #include "BTHContainerCache.h"
 
-#include <gtest/gtest.h>
-
-#include <algorithm>
 #include <cctype>
 
 #include "BTHContainerClass.h"

@@ -1,7 +1,5 @@
 #include "BTHError.h"
 
-#include <gtest/gtest.h>
-
 #include "TestSupport.h"
 
 namespace berth {

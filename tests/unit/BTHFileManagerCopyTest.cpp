@@ -5,7 +5,6 @@
 #include <sys/acl.h>
 #include <sys/xattr.h>
 
-#include <map>
 #include <sstream>
 
 #include "TestSupport.h"

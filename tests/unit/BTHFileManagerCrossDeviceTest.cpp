@@ -6,8 +6,6 @@
 #include <sys/mount.h>
 #include <sys/xattr.h>
 
-#include <map>
-
 #include "TestSupport.h"
 
 namespace berth {

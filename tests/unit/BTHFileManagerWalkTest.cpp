@@ -3,8 +3,6 @@
 // items.
 #include <fcntl.h>
 
-#include <map>
-
 #include "TestSupport.h"
 
 namespace berth {

@@ -391,17 +391,14 @@ class Occupancy {
         return total;
     }
     void checkIdentifier(size_t id, bool writing) {
-        expect(allWriters_ == 0);
-        if (writing) {
-            expect(writers_[id] == 1 && readers_[id] == 0 && allReaders_ == 0);
-        } else {
-            expect(writers_[id] == 0);
-        }
+        expect(allWriters_ == 0 &&
+               (writing ? writers_[id] == 1 && readers_[id] == 0 && allReaders_ == 0
+                        : writers_[id] == 0));
     }
     void checkAll(bool writing) {
-        expect(sum(writers_) == 0);
-        if (writing) expect(allWriters_ == 1 && allReaders_ == 0 && sum(readers_) == 0);
-        if (!writing) expect(allWriters_ == 0);
+        expect(sum(writers_) == 0 &&
+               (writing ? allWriters_ == 1 && allReaders_ == 0 && sum(readers_) == 0
+                        : allWriters_ == 0));
     }
 
     std::array<std::atomic<int>, kIdentifiers> readers_{};

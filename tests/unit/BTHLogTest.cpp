@@ -1,7 +1,5 @@
 #include "BTHLog.h"
 
-#include <gtest/gtest.h>
-
 #include <fstream>
 
 #include "TestSupport.h"

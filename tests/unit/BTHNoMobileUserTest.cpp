@@ -1,6 +1,5 @@
 // A device without a "mobile" account: the global configuration is a
 // per-process singleton, so this case has its own test program.
-#include <gtest/gtest.h>
 
 #include "BTHGlobalConfiguration.h"
 #include "ScratchDeviceRoot.h"

@@ -2,7 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <gtest/gtest.h>
 
 #include "TestSupport.h"
 #include "platform/UniqueFd.h"

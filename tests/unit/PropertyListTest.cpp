@@ -547,14 +547,10 @@ TEST(PropertyListTest, LibplistReadsWhatWeWrite) {
 TEST(PropertyListTest, WeReadWhatLibplistWritesInBothFormats) {
     PlistTree root(plist_new_dict());
     plist_t list = plist_new_array();
-    plist_array_append_item(list, plist_new_uint(0));
-    plist_array_append_item(list, plist_new_uint(300));
-    plist_array_append_item(list, plist_new_uint(uint64_t{1} << 40));
-    plist_array_append_item(list, plist_new_uint(static_cast<uint64_t>(-42)));
-    plist_array_append_item(list, plist_new_real(-2.75e-3));
-    plist_array_append_item(list, plist_new_bool(1));
-    plist_array_append_item(list, plist_new_dict());
-    plist_array_append_item(list, plist_new_array());
+    for (plist_t item : {plist_new_uint(0), plist_new_uint(300), plist_new_uint(uint64_t{1} << 40),
+                         plist_new_uint(static_cast<uint64_t>(-42)), plist_new_real(-2.75e-3),
+                         plist_new_bool(1), plist_new_dict(), plist_new_array()})
+        plist_array_append_item(list, item);
     plist_dict_set_item(root.get(), "list", list);
     plist_dict_set_item(root.get(), "ascii", plist_new_string("sys.kelp.berth"));
     plist_dict_set_item(root.get(), "text <&>", plist_new_string("\xC3\xA9t\xC3\xA9 \U0001F600"));

@@ -4,14 +4,9 @@
 #include "platform/ProtectionClass.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <stdlib.h>
-#include <sys/stat.h>
 #include <sys/xattr.h>
-#include <unistd.h>
 
-#include <filesystem>
-
+#include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
 #include "platform/KeyBagState.h"
 #include "platform/LockStateNotification.h"
@@ -23,14 +18,8 @@ namespace {
 namespace stdfs = std::filesystem;
 using test::ScratchDir;
 
-// This program's device root, named before anything reads it, so the lock
-// state file it writes is its own.
-const ScratchDir& deviceRoot() {
-    static const ScratchDir root;
-    return root;
-}
-[[maybe_unused]] const bool kRootNamed =
-    ::setenv("BERTH_ROOT", deviceRoot().path().c_str(), 1) == 0;
+// This program's own device root, so the lock state file it writes is its own.
+const bool kRootNamed = !test::installScratchDeviceRoot().empty();
 
 const protection::LockQuery kLocked = [] { return true; };
 const protection::LockQuery kUnlocked = [] { return false; };

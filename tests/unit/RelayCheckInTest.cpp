@@ -1,12 +1,9 @@
 // Checking in the daemon's endpoints, and the busy counter of transactions.
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstring>
 

@@ -1,12 +1,10 @@
 // libberth's connection: finding the daemon, matching replies, and telling
 // its failures apart.
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
 #include <future>
-#include <thread>
 
 #include "RelayTestServer.h"
 #include "ScratchDeviceRoot.h"

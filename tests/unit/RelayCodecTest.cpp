@@ -1,6 +1,5 @@
 #include "core/RelayCodec.h"
 
-#include <algorithm>
 #include <bit>
 #include <limits>
 

@@ -3,18 +3,14 @@
 // connect, exec, fork and exit while the server asks for their identity on
 // every request.
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <map>
-#include <string>
 
 #include "RelayTestServer.h"
 #include "ScratchDeviceRoot.h"

@@ -2,17 +2,11 @@
 // of delivery, parallel peers, peers that leave, broken and flooding peers,
 // and many peers at once.
 #include <fcntl.h>
-#include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
 
-#include <atomic>
-#include <condition_variable>
-#include <filesystem>
 #include <future>
-#include <map>
 #include <random>
-#include <thread>
 
 #include "RelayTestServer.h"
 #include "ScratchDeviceRoot.h"

@@ -4,12 +4,6 @@
 #include "platform/SafeFs.h"
 
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <string>
 
 #include "TestSupport.h"
 

@@ -1,7 +1,5 @@
 #include "platform/UserDatabase.h"
 
-#include <gtest/gtest.h>
-
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
 

@@ -3,11 +3,6 @@
 #include <fcntl.h>
 #include <grp.h>
 #include <sys/wait.h>
-#include <unistd.h>
-
-#include <algorithm>
-#include <chrono>
-#include <thread>
 
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
