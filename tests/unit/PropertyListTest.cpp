@@ -1,17 +1,17 @@
 #include "platform/PropertyList.h"
 
-#include <gtest/gtest.h>
 #include <plist/plist.h>
 
 #include <cmath>
 #include <cstdlib>
-#include <memory>
-#include <string>
+
+#include "TestSupport.h"
 
 namespace berth::plist {
 namespace {
 
 using Bytes = std::vector<uint8_t>;
+using test::identical;
 
 Bytes bytesOf(std::string_view s) {
     return Bytes(s.begin(), s.end());
@@ -84,12 +84,6 @@ Bytes binaryFile(const std::vector<Bytes>& objects, uint8_t refSize = 1, uint64_
     return out;
 }
 
-Bytes ref(uint64_t object, size_t size) {
-    Bytes b;
-    for (size_t i = size; i-- > 0;) b.push_back(static_cast<uint8_t>(object >> (8 * i)));
-    return b;
-}
-
 // `count` arrays, each holding `fanout` references to the next; the last is
 // empty.
 Bytes chainOfArrays(size_t count, size_t fanout) {
@@ -97,10 +91,9 @@ Bytes chainOfArrays(size_t count, size_t fanout) {
     std::vector<Bytes> objects;
     for (size_t i = 0; i + 1 < count; ++i) {
         Bytes o{static_cast<uint8_t>(0xA0 | fanout)};
-        for (size_t k = 0; k < fanout; ++k) {
-            Bytes r = ref(i + 1, refSize);
-            o.insert(o.end(), r.begin(), r.end());
-        }
+        for (size_t k = 0; k < fanout; ++k)
+            for (size_t b = refSize; b-- > 0;)
+                o.push_back(static_cast<uint8_t>((i + 1) >> (8 * b)));
         objects.push_back(o);
     }
     objects.push_back({0xA0});
@@ -120,10 +113,8 @@ TEST(PropertyListTest, EveryKindRoundTripsThroughTheBinaryFormat) {
     EXPECT_EQ(*back, original);
     // Unsigned values above INT64_MAX stay positive; negative ones stay negative.
     const Value::Array& ints = *back->find("integers")->arrayValue();
-    EXPECT_EQ(*ints[9].uint64Value(), UINT64_MAX);
-    EXPECT_EQ(ints[9].kind(), Value::Kind::UInt64);
-    EXPECT_EQ(*ints[10].int64Value(), -1);
-    EXPECT_EQ(ints[10].kind(), Value::Kind::Int64);
+    EXPECT_TRUE(identical(ints[9], Value(UINT64_MAX)));
+    EXPECT_TRUE(identical(ints[10], Value(int64_t{-1})));
     // A value that is not a dictionary is a property list too.
     EXPECT_EQ(*parse(serialized(Value("top"))), Value("top"));
 }
@@ -447,34 +438,31 @@ using PlistTree = std::unique_ptr<void, PlistFree>;
 // libplist's reading of a tree. It keeps every integer in one unsigned
 // 64-bit kind, so integers become UInt64 with the same bits; compare with
 // integerBits() of our value.
+// One value of a node, read by libplist's getter `get`.
+template <class T, class Getter>
+T read(plist_t node, Getter get) {
+    T value{};
+    get(node, &value);
+    return value;
+}
+
 Value fromLibplist(plist_t node) {
     switch (plist_get_node_type(node)) {
-        case PLIST_BOOLEAN: {
-            uint8_t b;
-            plist_get_bool_val(node, &b);
-            return Value(b != 0);
-        }
-        case PLIST_UINT: {
-            uint64_t u;
-            plist_get_uint_val(node, &u);
-            return Value(u);
-        }
-        case PLIST_REAL: {
-            double d;
-            plist_get_real_val(node, &d);
-            return Value(d);
-        }
+        case PLIST_BOOLEAN:
+            return Value(read<uint8_t>(node, plist_get_bool_val) != 0);
+        case PLIST_UINT:
+            return Value(read<uint64_t>(node, plist_get_uint_val));
+        case PLIST_REAL:
+            return Value(read<double>(node, plist_get_real_val));
         case PLIST_DATE: {
             int32_t sec, usec;
             plist_get_date_val(node, &sec, &usec);
             return Value(Value::Date{sec + usec / 1e6 + 978307200.0});
         }
         case PLIST_STRING: {
-            char* s = nullptr;
-            plist_get_string_val(node, &s);
-            Value v(s);
-            std::free(s);
-            return v;
+            std::unique_ptr<char, decltype(&std::free)> s(read<char*>(node, plist_get_string_val),
+                                                          std::free);
+            return Value(s.get());
         }
         case PLIST_DATA: {
             char* d = nullptr;

@@ -15,7 +15,7 @@ namespace berth {
 namespace {
 
 using namespace std::chrono_literals;
-using test::dictionaryWith;
+using test::dict;
 using test::RelayTestServer;
 
 [[maybe_unused]] const auto& kRoot = test::installScratchDeviceRoot();
@@ -72,13 +72,13 @@ TEST(RelayClientTest, ALateReplyIsDroppedAndNeverAnswersTheNextRequest) {
     auto connection = BerthConnection::connect(server.path(), &error);
     ASSERT_TRUE(connection) << error.message;
 
-    EXPECT_FALSE(connection->request(dictionaryWith("Slow", true), 100ms, &error));
+    EXPECT_FALSE(connection->request(dict({{"Slow", true}}), 100ms, &error));
     EXPECT_EQ(error.code, BerthError::Code::Timeout) << error.message;
     release.set();
     // Queued behind the slow one on the daemon, so its reply comes second.
-    auto reply = connection->request(dictionaryWith("Fast", true), 20s, &error);
+    auto reply = connection->request(dict({{"Fast", true}}), 20s, &error);
     ASSERT_TRUE(reply) << error.message;
-    EXPECT_EQ(*reply->find("Echo"), dictionaryWith("Fast", true));
+    EXPECT_EQ(*reply->find("Echo"), dict({{"Fast", true}}));
     EXPECT_TRUE(connection->isOpen());
 }
 

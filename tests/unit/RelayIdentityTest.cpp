@@ -19,7 +19,7 @@
 namespace berth {
 namespace {
 
-using test::dictionaryWith;
+using test::dict;
 using test::RelayTestServer;
 
 // ---------------------------------------------------------------------------
@@ -57,8 +57,8 @@ void answer(const std::string& line) {
         if (!command.empty() && command.back() == '\n') command.pop_back();
         if (command.rfind("send ", 0) == 0) {
             const uint64_t tag = std::strtoull(command.c_str() + 5, nullptr, 10);
-            if (!test::writeAll(fd, test::frameBytes(relay::FrameKind::Request, tag,
-                                                     dictionaryWith("Tag", tag))))
+            if (!test::writeAll(
+                    fd, test::frameBytes(relay::FrameKind::Request, tag, dict({{"Tag", tag}}))))
                 _exit(4);
             answer(test::readFrames(fd, 1).size() == 1 ? "ok" : "no reply");
         } else if (command == "exec") {
@@ -150,7 +150,7 @@ class ClientProcess {
 };
 
 Value entitlementsAllowing(const char* key) {
-    return dictionaryWith(key, true);
+    return dict({{key, true}});
 }
 
 class RelayIdentityTest : public ::testing::Test {

@@ -16,7 +16,7 @@ namespace berth {
 namespace {
 
 using namespace std::chrono_literals;
-using test::dictionaryWith;
+using test::dict;
 using test::RelayTestServer;
 
 [[maybe_unused]] const auto& kRoot = test::installScratchDeviceRoot();
@@ -55,8 +55,7 @@ TEST(RelayTest, PipelinedRequestsAreHandledAndAnsweredInOrder) {
     constexpr uint64_t kCount = 200;
     std::vector<uint8_t> all;
     for (uint64_t seq = 0; seq < kCount; ++seq) {
-        auto frame =
-            test::frameBytes(relay::FrameKind::Request, 1000 + seq, dictionaryWith("Seq", seq));
+        auto frame = test::frameBytes(relay::FrameKind::Request, 1000 + seq, dict({{"Seq", seq}}));
         all.insert(all.end(), frame.begin(), frame.end());
     }
     // All at once, so that many requests are waiting at the same time.
@@ -83,7 +82,7 @@ TEST(RelayTest, ThreadsSharingAClientConnectionEachGetTheirOwnReply) {
             for (uint64_t i = 0; i < 50; ++i) {
                 const uint64_t seq = thread * 1000 + i;
                 BerthError error;
-                auto reply = connection->request(dictionaryWith("Seq", seq), 20s, &error);
+                auto reply = connection->request(dict({{"Seq", seq}}), 20s, &error);
                 if (!reply || numberAt(*reply, "Seq") != seq) ++mismatches;
             }
         });
@@ -102,13 +101,14 @@ TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
     auto fast = connectTo(server);
     ASSERT_TRUE(slow && fast);
 
-    auto slowReply = std::async(std::launch::async,
-                                [&] { return slow->request(dictionaryWith("Block", true), 30s); });
+    auto slowReply = std::async(std::launch::async, [&] {
+        return slow->request(dict({{"Block", true}}), 30s);
+    });
     ASSERT_TRUE(blocking.wait());
     // The blocked handler still runs; the other peer is served meanwhile.
     for (uint64_t seq = 0; seq < 20; ++seq) {
         BerthError error;
-        auto reply = fast->request(dictionaryWith("Seq", seq), 20s, &error);
+        auto reply = fast->request(dict({{"Seq", seq}}), 20s, &error);
         ASSERT_TRUE(reply) << error.message;
         EXPECT_EQ(numberAt(*reply, "Seq"), seq);
     }
@@ -125,7 +125,7 @@ TEST(RelayTest, APeerThatLeavesBeforeItsReplyCostsNothingButThatReply) {
     {
         UniqueFd leaving = server.connectRaw();
         ASSERT_TRUE(test::writeAll(leaving.get(), test::frameBytes(relay::FrameKind::Request, 1,
-                                                                   dictionaryWith("Block", true))));
+                                                                   dict({{"Block", true}}))));
         // A second request that will never start: its peer is gone by then.
         ASSERT_TRUE(test::writeAll(
             leaving.get(), test::frameBytes(relay::FrameKind::Request, 2, Value::dictionary())));
@@ -209,7 +209,7 @@ TEST(RelayTest, ABrokenFrameDropsItsConnectionAndNothingElse) {
         EXPECT_TRUE(server.waitFor([&] { return server.logged(bad.logged); }));
 
         BerthError error;
-        auto reply = bystander->request(dictionaryWith("Seq", uint64_t{5}), 20s, &error);
+        auto reply = bystander->request(dict({{"Seq", uint64_t{5}}}), 20s, &error);
         ASSERT_TRUE(reply) << error.message;
         EXPECT_EQ(numberAt(*reply, "Seq"), 5u);
     }
@@ -237,7 +237,7 @@ TEST(RelayTest, AFloodingPeerIsHeldBackNotBufferedAndLosesNothing) {
     uint64_t sent = 0;
     bool heldBack = false;
     while (sent < kMostAttempted && !heldBack) {
-        auto frame = test::frameBytes(relay::FrameKind::Request, sent, dictionaryWith("Seq", sent));
+        auto frame = test::frameBytes(relay::FrameKind::Request, sent, dict({{"Seq", sent}}));
         const ssize_t count = ::send(flooder.get(), frame.data(), frame.size(), MSG_NOSIGNAL);
         if (count < 0 && errno == EAGAIN) {
             pollfd writable{flooder.get(), POLLOUT, 0};
@@ -269,7 +269,7 @@ TEST(RelayTest, APeerThatLeavesItsRepliesUnreadIsDroppedAtTheOutputBound) {
     UniqueFd hoarder = server.connectRaw();
     std::vector<uint8_t> requests;
     for (uint64_t id = 0; id < 32; ++id) {
-        auto frame = test::frameBytes(relay::FrameKind::Request, id, dictionaryWith("Big", true));
+        auto frame = test::frameBytes(relay::FrameKind::Request, id, dict({{"Big", true}}));
         requests.insert(requests.end(), frame.begin(), frame.end());
     }
     ASSERT_TRUE(test::writeAll(hoarder.get(), requests));
@@ -303,7 +303,7 @@ TEST(RelayTest, TwoHundredPeersAreServedAtOnce) {
             BerthError error;
             auto connection = BerthConnection::connect(server.path(), &error);
             if (!connection) return;
-            auto reply = connection->request(dictionaryWith("Seq", seq), 90s, &error);
+            auto reply = connection->request(dict({{"Seq", seq}}), 90s, &error);
             if (reply && numberAt(*reply, "Seq") == seq && *reply->find("Together")->boolValue())
                 ++together;
         });

@@ -3,18 +3,10 @@
 // handler supplied by the test. Records what the connections went through.
 #pragma once
 
-#include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
-#include <chrono>
-#include <condition_variable>
 #include <cstring>
-#include <functional>
-#include <memory>
-#include <mutex>
-#include <string>
-#include <vector>
 
 #include "TestSupport.h"
 #include "core/RelayCodec.h"
@@ -93,26 +85,14 @@ class RelayTestServer {
     }
 
     // Waits until `predicate` holds, or a generous limit that only a broken
-    // server reaches. The predicate runs without the server's lock held.
+    // server reaches.
     bool waitFor(const std::function<bool()>& predicate) {
-        const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-        while (!predicate()) {
-            if (std::chrono::steady_clock::now() > limit) return false;
-            std::unique_lock lock(state_->mutex);
-            state_->changed.wait_for(lock, std::chrono::milliseconds(10));
-        }
-        return true;
+        return eventually(predicate, std::chrono::seconds(20));
     }
 
-    size_t invalidated() {
-        std::lock_guard lock(state_->mutex);
-        return state_->invalidated;
-    }
+    size_t invalidated() { return state_->invalidated; }
     // The replies whose send() failed (the peer was gone).
-    size_t unsent() {
-        std::lock_guard lock(state_->mutex);
-        return state_->unsent;
-    }
+    size_t unsent() { return state_->unsent; }
     std::vector<std::string> log() {
         std::lock_guard lock(state_->mutex);
         return state_->log;
@@ -126,19 +106,16 @@ class RelayTestServer {
   private:
     struct State {
         Handler handler;
-        std::mutex mutex;
-        std::condition_variable changed;
-        size_t invalidated = 0;
-        size_t unsent = 0;
+        std::mutex mutex;  // guards the log
+        std::atomic<size_t> invalidated = 0;
+        std::atomic<size_t> unsent = 0;
         std::vector<std::string> log;
     };
 
     static void onEvent(State& state, const std::shared_ptr<RelayConnection>& connection,
                         const RelayEvent& event) {
         if (event.isConnectionInvalid()) {
-            std::lock_guard lock(state.mutex);
             ++state.invalidated;
-            state.changed.notify_all();
             return;
         }
         std::optional<RelayReply> reply = event.makeReply();
@@ -147,11 +124,7 @@ class RelayTestServer {
             return;
         }
         state.handler(event, *reply);
-        if (!reply->send()) {
-            std::lock_guard lock(state.mutex);
-            ++state.unsent;
-            state.changed.notify_all();
-        }
+        if (!reply->send()) ++state.unsent;
     }
 
     std::shared_ptr<State> state_;
@@ -208,12 +181,6 @@ inline bool readsEndOfStream(int fd) {
     do got = ::read(fd, &byte, 1);
     while (got < 0 && errno == EINTR);
     return got == 0 || (got < 0 && errno == ECONNRESET);
-}
-
-inline Value dictionaryWith(const std::string& key, Value value) {
-    Value dictionary = Value::dictionary();
-    dictionary.set(key, std::move(value));
-    return dictionary;
 }
 
 }  // namespace berth::test
