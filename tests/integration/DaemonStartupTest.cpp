@@ -3,7 +3,6 @@
 // error replies, and the request socket's intake.
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 
 #include <cstring>
 
@@ -110,13 +109,10 @@ TEST_F(DaemonStartupTest, RequestsFromAnUnsignedCallerReachOnlyOpenCommands) {
 
 TEST_F(DaemonStartupTest, UpcallRequestsGetErrorReplies) {
     ASSERT_NO_FATAL_FAILURE(start());
-    int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
-    ASSERT_GE(fd, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    const auto path = root() / "run/berthd/sys.kelp.berthd.upcall";
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    ASSERT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    const UniqueFd upcall =
+        test::connectUnix(root() / "run/berthd/sys.kelp.berthd.upcall", SOCK_SEQPACKET);
+    ASSERT_TRUE(upcall) << strerror(errno);
+    const int fd = upcall.get();
 
     for (uint32_t id : {kBTHUpcallRequestId, kBTHUpcallRequestId + 1}) {
         uint32_t message[13] = {};
@@ -134,7 +130,6 @@ TEST_F(DaemonStartupTest, UpcallRequestsGetErrorReplies) {
         EXPECT_EQ(static_cast<int32_t>(reply[8]),
                   id == kBTHUpcallRequestId ? kBTHUpcallCannotServe : kBTHUpcallBadMessageId);
     }
-    ::close(fd);
 }
 
 }  // namespace

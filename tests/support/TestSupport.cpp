@@ -5,10 +5,12 @@
 #include <linux/fs.h>
 #include <spdlog/sinks/base_sink.h>
 #include <sys/ioctl.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 
 #include <bit>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 
@@ -128,6 +130,16 @@ bool setImmutable(const std::filesystem::path& path, bool on) {
     if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) return false;
     flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
     return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) == 0;
+}
+
+UniqueFd connectUnix(const std::filesystem::path& path, int type) {
+    UniqueFd fd(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    if (fd && ::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
+        fd.reset();
+    return fd;
 }
 
 struct stat lstatOf(const std::filesystem::path& path) {

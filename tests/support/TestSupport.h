@@ -4,6 +4,7 @@
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -25,6 +26,7 @@
 #include "BTHError.h"
 #include "BTHFileManager.h"
 #include "core/Value.h"
+#include "platform/UniqueFd.h"
 
 namespace berth::test {
 
@@ -76,6 +78,10 @@ std::string readFile(const std::filesystem::path& path);
 
 // Sets or clears the immutable flag of `path` (not following a link).
 bool setImmutable(const std::filesystem::path& path, bool on);
+
+// A Unix socket of `type` connected to `path`; on failure invalid, with errno
+// telling why.
+UniqueFd connectUnix(const std::filesystem::path& path, int type = SOCK_STREAM);
 
 // lstat of `path`, failing the test when there is none.
 struct stat lstatOf(const std::filesystem::path& path);

@@ -133,10 +133,10 @@ TEST(BTHFileManagerCopy, KeepsDataModeOwnerTimesAttributesAclsFlagsAndLinks) {
     const stdfs::path source = dir / "source", dest = dir / "dest";
     buildRichTree(source);
     const auto before = describeTree(source);
-    const struct timespec linkAccess = lstatOf(source / "sub/link").st_atim;
+    const auto linkAccess = lstatOf(source / "sub/link").st_atim;
     BTHErrorRef error;
     const bool copied = manager().copyItemAtURL(source, dest, &error);
-    const struct timespec copiedLinkAccess = lstatOf(dest / "sub/link").st_atim;
+    const auto copiedLinkAccess = lstatOf(dest / "sub/link").st_atim;
     const auto after = describeTree(dest);
     clearFlags(source);
     clearFlags(dest);

@@ -2,10 +2,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
-
-#include <cstring>
 
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
@@ -21,23 +18,13 @@ namespace {
 
 // 0 when a client can connect to the socket at `path`, else the errno.
 int connectError(const std::filesystem::path& path, int type = SOCK_STREAM) {
-    UniqueFd fd(::socket(AF_UNIX, type | SOCK_CLOEXEC, 0));
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    return ::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) == 0 ? 0
-                                                                                           : errno;
+    return test::connectUnix(path, type) ? 0 : errno;
 }
 
 // True when a connection is waiting on the listening socket `fd`.
 bool acceptsOne(int fd) {
     UniqueFd peer(::accept4(fd, nullptr, nullptr, SOCK_CLOEXEC));
     return peer.valid();
-}
-
-ino_t inodeOf(const std::filesystem::path& path) {
-    struct stat status {};
-    return ::lstat(path.c_str(), &status) == 0 ? status.st_ino : 0;
 }
 
 TEST(RelayCheckInTest, EndpointsLiveInTheRuntimeDirectoryWithTheirTypeAndMode) {
@@ -60,8 +47,7 @@ TEST(RelayCheckInTest, EndpointsLiveInTheRuntimeDirectoryWithTheirTypeAndMode) {
     for (const auto& endpoint : expected) {
         SCOPED_TRACE(endpoint.name);
         EXPECT_EQ(endpoint.endpoint.path(), ServiceCheckIn::runtimeDirectory() / endpoint.name);
-        struct stat status {};
-        ASSERT_EQ(::lstat(endpoint.endpoint.path().c_str(), &status), 0);
+        const struct stat status = test::lstatOf(endpoint.endpoint.path());
         EXPECT_TRUE(S_ISSOCK(status.st_mode));
         EXPECT_EQ(status.st_mode & 07777, endpoint.mode);
         int type = 0;
@@ -77,7 +63,7 @@ TEST(RelayCheckInTest, ASecondClaimFailsAndLeavesTheFirstUntouched) {
     std::string why;
     auto first = ServiceCheckIn::claim("endpoint", SOCK_STREAM, 0666, nullptr, &why, dir.path());
     ASSERT_TRUE(first) << why;
-    const ino_t socketInode = inodeOf(first->path());
+    const ino_t socketInode = test::lstatOf(first->path()).st_ino;
 
     int error = 0;
     EXPECT_FALSE(ServiceCheckIn::claim("endpoint", SOCK_STREAM, 0666, &error, &why, dir.path()));
@@ -85,7 +71,7 @@ TEST(RelayCheckInTest, ASecondClaimFailsAndLeavesTheFirstUntouched) {
     EXPECT_NE(why.find("another process"), std::string::npos) << why;
 
     // The first holder's socket is still the one in place, and still works.
-    EXPECT_EQ(inodeOf(first->path()), socketInode);
+    EXPECT_EQ(test::lstatOf(first->path()).st_ino, socketInode);
     EXPECT_EQ(connectError(first->path()), 0);
     EXPECT_TRUE(acceptsOne(first->socket()));
 

@@ -153,6 +153,16 @@ Value entitlementsAllowing(const char* key) {
     return dict({{key, true}});
 }
 
+// `identity` of process `pid` no longer bound to its socket, so without
+// signing identifier and entitlements, for the reason `why`.
+void expectUnbound(const RelayPeerIdentity& identity, pid_t pid, const std::string& why) {
+    EXPECT_EQ(identity.pid, pid);
+    EXPECT_FALSE(identity.processStillBound);
+    EXPECT_FALSE(identity.signingIdentifier);
+    EXPECT_FALSE(identity.entitlements);
+    EXPECT_NE(identity.signingError.find(why), std::string::npos) << identity.signingError;
+}
+
 class RelayIdentityTest : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -222,13 +232,7 @@ TEST_F(RelayIdentityTest, AnUnsignedPeerThatExecsASignedProgramGainsNothing) {
 
     ASSERT_EQ(client.command("exec"), "connected");
     ASSERT_EQ(client.command("send 2"), "ok");
-    RelayPeerIdentity identity = seen(2);
-    EXPECT_EQ(identity.pid, client.pid());
-    EXPECT_FALSE(identity.processStillBound);
-    EXPECT_FALSE(identity.signingIdentifier);
-    EXPECT_FALSE(identity.entitlements);
-    EXPECT_NE(identity.signingError.find("another executable"), std::string::npos)
-        << identity.signingError;
+    expectUnbound(seen(2), client.pid(), "another executable");
 }
 
 TEST_F(RelayIdentityTest, ASocketOutlivingTheProcessThatConnectedCarriesNoIdentity) {
@@ -243,13 +247,7 @@ TEST_F(RelayIdentityTest, ASocketOutlivingTheProcessThatConnectedCarriesNoIdenti
     ASSERT_EQ(forked.rfind("forked ", 0), 0u) << forked;
     client.reap();
     ASSERT_EQ(client.command("send 2"), "ok");
-
-    RelayPeerIdentity identity = seen(2);
-    EXPECT_EQ(identity.pid, client.pid());
-    EXPECT_FALSE(identity.processStillBound);
-    EXPECT_FALSE(identity.signingIdentifier);
-    EXPECT_FALSE(identity.entitlements);
-    EXPECT_NE(identity.signingError.find("exited"), std::string::npos) << identity.signingError;
+    expectUnbound(seen(2), client.pid(), "exited");
 }
 
 }  // namespace

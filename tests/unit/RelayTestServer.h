@@ -3,9 +3,6 @@
 // handler supplied by the test. Records what the connections went through.
 #pragma once
 
-#include <sys/socket.h>
-#include <sys/un.h>
-
 #include <cstring>
 
 #include "TestSupport.h"
@@ -71,12 +68,8 @@ class RelayTestServer {
 
     // A raw client socket connected to the server.
     UniqueFd connectRaw() const {
-        UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::strncpy(address.sun_path, path_.c_str(), sizeof address.sun_path - 1);
-        EXPECT_EQ(::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0)
-            << strerror(errno);
+        UniqueFd fd = connectUnix(path_);
+        EXPECT_TRUE(fd) << strerror(errno);
         // Reads give up eventually, so a server that never answers fails the
         // test instead of hanging it.
         timeval limit{20, 0};

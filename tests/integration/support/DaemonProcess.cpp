@@ -2,16 +2,13 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
 #include <cstring>
 #include <fstream>
 #include <sstream>
-#include <thread>
-#include <vector>
+
+#include "TestSupport.h"
 
 namespace berth::test {
 
@@ -24,14 +21,7 @@ std::optional<int> decodeStatus(int status) {
 }
 
 bool accepts(const std::filesystem::path& socketPath) {
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0) return false;
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-    bool ok = ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    ::close(fd);
-    return ok;
+    return connectUnix(socketPath).valid();
 }
 
 }  // namespace
