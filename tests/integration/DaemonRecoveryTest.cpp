@@ -155,6 +155,29 @@ class DaemonRecoveryTest : public DaemonFixture {
         EXPECT_EQ(readFile(container.markerAt(path)), container.marker);
     }
 
+    // Where a replace puts `replacement` (a data container of user 501).
+    static fs::path destinationOf(const Container& replacement) {
+        return root() / kDataClassDirectory / replacement.path.filename();
+    }
+
+    // The replace went through: `replacement` holds the place, `old` is gone.
+    void expectReplaced(const Container& old, const Container& replacement) {
+        expectLookUp(old.identifier, replacement.uuid, destinationOf(replacement));
+        expectFoundAt(replacement, destinationOf(replacement), false);
+        EXPECT_EQ(code(call(metadataOf(old))), uint64_t{BTHErrorNotFound});
+        EXPECT_FALSE(fs::exists(old.path));
+        EXPECT_FALSE(fs::exists(replacement.path));
+    }
+
+    // The replace was undone: both are where they were, the old marker in
+    // exactly one place.
+    void expectUndone(const Container& old, const Container& replacement) {
+        EXPECT_EQ(filesNamed(old.marker), std::vector<fs::path>{old.markerAt(old.path)});
+        expectLookUp(old.identifier, old.uuid, old.path);
+        expectFoundAt(old, old.path, false);
+        expectFoundAt(replacement, replacement.path, true);
+    }
+
     std::string tag_;
 };
 
@@ -189,7 +212,7 @@ TEST_P(DaemonReplaceCrashTest, RestartFinishesOrUndoesTheReplace) {
     ASSERT_NO_FATAL_FAILURE(make(kDataClass, kMobile, identifier, true,
                                  std::string("new-") + crash.name, &replacement));
     ASSERT_NE(replacement.path.parent_path(), old.path.parent_path());
-    const fs::path destination = root() / kDataClassDirectory / replacement.path.filename();
+    const fs::path destination = destinationOf(replacement);
 
     ASSERT_NO_FATAL_FAILURE(callIntoCrash(replace(&old, replacement)));
 
@@ -218,29 +241,20 @@ TEST_P(DaemonReplaceCrashTest, RestartFinishesOrUndoesTheReplace) {
         // The replace had done its work: the new container holds the place,
         // and the old contents were destroyed with the staging leftovers.
         EXPECT_EQ(filesNamed(old.marker), std::vector<fs::path>{});
-        EXPECT_FALSE(fs::exists(old.path));
-        EXPECT_FALSE(fs::exists(replacement.path));
         EXPECT_EQ(filesNamed(replacement.marker),
                   std::vector<fs::path>{replacement.markerAt(destination)});
-        expectLookUp(identifier, replacement.uuid, destination);
-        expectFoundAt(replacement, destination, false);
-        EXPECT_EQ(code(call(metadataOf(old))), uint64_t{BTHErrorNotFound});
+        expectReplaced(old, replacement);
         return;
     }
-    // Undone: both containers are where they were before the replace, each
-    // marker in exactly one place.
-    EXPECT_EQ(filesNamed(old.marker), std::vector<fs::path>{old.markerAt(old.path)});
+    // Undone: each marker in exactly one place, where it was.
     EXPECT_EQ(filesNamed(replacement.marker),
               std::vector<fs::path>{replacement.markerAt(replacement.path)});
     EXPECT_FALSE(fs::exists(destination));
-    expectLookUp(identifier, old.uuid, old.path);
-    expectFoundAt(old, old.path, false);
-    expectFoundAt(replacement, replacement.path, true);
-
+    expectUndone(old, replacement);
     // The recovered store lets the same replace run to its end.
     const Value again = call(replace(&old, replacement));
     ASSERT_EQ(code(again), uint64_t{BTHErrorSuccess}) << again.description();
-    expectLookUp(identifier, replacement.uuid, destination);
+    expectReplaced(old, replacement);
     expectNoReplaceInProgress();
 }
 
@@ -307,14 +321,9 @@ TEST_F(DaemonRecoveryTest, ReplaceRefusalsTouchNothingAndASuccessRetiresTheOld) 
     expectLookUp(identifier, old.uuid, old.path);
     expectNoReplaceInProgress();
 
-    const fs::path destination = root() / kDataClassDirectory / replacement.path.filename();
     const Value replaced = call(replace(&old, replacement));
     ASSERT_EQ(code(replaced), uint64_t{BTHErrorSuccess}) << replaced.description();
-    expectLookUp(identifier, replacement.uuid, destination);
-    expectFoundAt(replacement, destination, false);
-    EXPECT_EQ(code(call(metadataOf(old))), uint64_t{BTHErrorNotFound});
-    EXPECT_FALSE(fs::exists(old.path));
-    EXPECT_FALSE(fs::exists(replacement.path));
+    expectReplaced(old, replacement);
     expectNoReplaceInProgress();
     // The old contents are on death row (or already destroyed) until it is
     // emptied, and nowhere afterwards.
@@ -330,9 +339,8 @@ TEST_F(DaemonRecoveryTest, ReplaceRefusalsTouchNothingAndASuccessRetiresTheOld) 
         make(kDataClass, kMobile, named("sys.kelp.replace.fresh"), true, "replace-fresh", &fresh));
     const Value promoted = call(replace(nullptr, fresh));
     ASSERT_EQ(code(promoted), uint64_t{BTHErrorSuccess}) << promoted.description();
-    const fs::path freshPlace = root() / kDataClassDirectory / fresh.path.filename();
-    expectLookUp(fresh.identifier, fresh.uuid, freshPlace);
-    expectFoundAt(fresh, freshPlace, false);
+    expectLookUp(fresh.identifier, fresh.uuid, destinationOf(fresh));
+    expectFoundAt(fresh, destinationOf(fresh), false);
 }
 
 // Clears the immutable flag it was given when it goes.
@@ -355,18 +363,13 @@ TEST_F(DaemonRecoveryTest, AFailedSecondMovePutsTheOldContainerBack) {
         const ImmutableFlag flag{replacement.path};
         EXPECT_EQ(code(call(replace(&old, replacement))), uint64_t{BTHErrorReplaceFailed});
     }
-    EXPECT_EQ(filesNamed(old.marker), std::vector<fs::path>{old.markerAt(old.path)});
-    expectLookUp(identifier, old.uuid, old.path);
-    expectFoundAt(old, old.path, false);
-    expectFoundAt(replacement, replacement.path, true);
+    expectUndone(old, replacement);
     expectNoReplaceInProgress();
-
     // The container put back is whole in the daemon's eyes: the same replace
     // goes through once the new container can move.
     const Value again = call(replace(&old, replacement));
     ASSERT_EQ(code(again), uint64_t{BTHErrorSuccess}) << again.description();
-    expectLookUp(identifier, replacement.uuid,
-                 root() / kDataClassDirectory / replacement.path.filename());
+    expectReplaced(old, replacement);
 }
 
 }  // namespace

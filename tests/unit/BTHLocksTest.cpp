@@ -104,15 +104,11 @@ TEST(BTHLocksTest, ArraysTakeEachIdentifierOnceAscendingAndReleaseDescending) {
     for (bool asValue : {false, true}) {
         for (const Case& c : cases) {
             SCOPED_TRACE(testing::PrintToString(c.identifiers) + (asValue ? " as value" : ""));
-            Value::Array elements(c.identifiers.begin(), c.identifiers.end());
-            Value value(elements);
-            std::vector<std::string> messages;
+            const Value value(Value::Array(c.identifiers.begin(), c.identifiers.end()));
+            std::vector<std::string> seen;
             {
                 test::LogCapture log;
-                if (asValue)
-                    _lock_identifier(value, false);
-                else
-                    _lock_identifier(c.identifiers, false);
+                asValue ? _lock_identifier(value, false) : _lock_identifier(c.identifiers, false);
                 BTHLocksSnapshot held = BTHLocksSnapshotForTesting();
                 EXPECT_EQ(held.identifierReaderCount, static_cast<int32_t>(c.takeOrder.size()));
                 ASSERT_EQ(held.records.size(), c.takeOrder.size());
@@ -120,22 +116,17 @@ TEST(BTHLocksTest, ArraysTakeEachIdentifierOnceAscendingAndReleaseDescending) {
                     EXPECT_EQ(record.useCount, 1u) << record.identifier;
                     EXPECT_EQ(record.lockState, 1) << record.identifier;
                 }
-                if (asValue)
-                    unlock_identifier(value);
-                else
-                    unlock_identifier(c.identifiers);
-                for (const auto& line : log.lines()) messages.push_back(line.message);
+                asValue ? unlock_identifier(value) : unlock_identifier(c.identifiers);
+                for (const auto& line : log.lines())
+                    if (line.message.starts_with("Got lock") ||
+                        line.message.starts_with("Unlocked identifier"))
+                        seen.push_back(line.message);
             }
             expectNothingHeld();
-
             std::vector<std::string> expected;
             for (const auto& id : c.takeOrder) expected.push_back("Got lock on identifier " + id);
             for (auto id = c.takeOrder.rbegin(); id != c.takeOrder.rend(); ++id)
                 expected.push_back("Unlocked identifier " + *id);
-            std::vector<std::string> seen;
-            for (const auto& message : messages)
-                if (message.starts_with("Got lock") || message.starts_with("Unlocked identifier"))
-                    seen.push_back(message);
             EXPECT_EQ(seen, expected);
         }
     }
