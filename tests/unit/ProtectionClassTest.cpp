@@ -54,12 +54,13 @@ TEST(ProtectionClassTest, ItemsWithoutAClassTakeTheNearestAncestorsOrZero) {
 
     ASSERT_EQ(setClass(dir / "a", 3), 0);
     ASSERT_EQ(setClass(dir / "a/b/c", 2), 0);
-    EXPECT_EQ(classOf(dir / "a"), 3);
-    EXPECT_EQ(classOf(dir / "a/b"), 3);
-    EXPECT_EQ(classOf(dir / "a/b/file"), 3);
-    EXPECT_EQ(classOf(dir / "a/b/c"), 2);
-    EXPECT_EQ(classOf(dir / "a/b/c/d/file"), 2);
-    EXPECT_EQ(classOf(dir / "plain"), 0);
+    for (const auto& [item, expected] : {std::pair{"a", 3},
+                                         {"a/b", 3},
+                                         {"a/b/file", 3},
+                                         {"a/b/c", 2},
+                                         {"a/b/c/d/file", 2},
+                                         {"plain", 0}})
+        EXPECT_EQ(classOf(dir / item), expected) << item;
 
     // A file's own class wins over its directory's; negative classes are kept.
     ASSERT_EQ(setClass(dir / "a/b/file", -7), 0);

@@ -20,12 +20,12 @@ TEST(SafeFsTest, OpeningAndRenamingRefuseLinksInAnyComponent) {
     stdfs::create_directory_symlink(outside.path(), dir / "dirlink");
     stdfs::create_symlink(outside / "target", dir / "filelink");
 
-    EXPECT_FALSE(fs::openNoFollow(dir / "dirlink/target", O_RDONLY));
-    EXPECT_EQ(errno, ELOOP);
-    EXPECT_FALSE(fs::openNoFollow(dir / "dirlink", O_RDONLY | O_DIRECTORY));
-    EXPECT_EQ(errno, ELOOP);
-    EXPECT_FALSE(fs::openNoFollow(dir / "filelink", O_RDONLY));
-    EXPECT_EQ(errno, ELOOP);
+    for (const auto& [path, flags] : {std::pair{dir / "dirlink/target", O_RDONLY},
+                                      {dir / "dirlink", O_RDONLY | O_DIRECTORY},
+                                      {dir / "filelink", O_RDONLY}}) {
+        EXPECT_FALSE(fs::openNoFollow(path, flags)) << path;
+        EXPECT_EQ(errno, ELOOP) << path;
+    }
 
     // A link as the last component is described and renamed itself.
     struct stat st;
@@ -39,15 +39,10 @@ TEST(SafeFsTest, OpeningAndRenamingRefuseLinksInAnyComponent) {
     EXPECT_EQ(test::readFile(outside / "target"), "t");
 
     // chmod by name changes the item, never a link's target.
-    const struct stat before = [&] {
-        struct stat s;
-        ::stat((outside / "target").c_str(), &s);
-        return s;
-    }();
+    const mode_t before = test::lstatOf(outside / "target").st_mode;
     UniqueFd parent = fs::openNoFollow(dir.path(), O_PATH | O_DIRECTORY);
     EXPECT_NE(fs::chmodAtNoFollow(parent.get(), "renamed", 0600), 0);
-    ASSERT_EQ(::stat((outside / "target").c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode, before.st_mode);
+    EXPECT_EQ(test::lstatOf(outside / "target").st_mode, before);
 }
 
 TEST(SafeFsTest, CheckedOpensRefuseAnItemOtherThanTheOneSeen) {
