@@ -17,9 +17,7 @@
 #include <cstdlib>
 #include <thread>
 
-#include "DaemonProcess.h"
-#include "ScratchDeviceRoot.h"
-#include "TestSupport.h"
+#include "DaemonSupport.h"
 #include "client/libberth/BerthConnection.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
@@ -30,9 +28,15 @@ namespace {
 
 namespace fs = std::filesystem;
 
+using test::about;
+using test::code;
+using test::create;
+using test::listing;
+using test::request;
+using test::text;
+
 const fs::path& root() {
-    static const fs::path& path = test::installScratchDeviceRoot();
-    return path;
+    return test::deviceRoot();
 }
 const bool kRootInstalled = !root().empty();
 
@@ -40,7 +44,7 @@ constexpr const char* kSelf = "sys.kelp.removal.tester";
 constexpr const char* kAllowed = "sys.kelp.private.Berth.allowed";
 constexpr const char* kOtherIdLookup = "sys.kelp.private.Berth.otherIdLookup";
 constexpr const char* kWipeContainer = "sys.kelp.private.Berth.wipeContainer";
-const fs::path kDataClassDirectory = "private/var/mobile/Containers/Data/Application";
+using test::kDataClassDirectory;
 const fs::path kCachesDirectory = "private/var/root/Library/Caches/sys.kelp.berthd";
 
 fs::path deathRow() {
@@ -50,33 +54,8 @@ fs::path deviceTmp() {
     return root() / "tmp";
 }
 
-Value request(uint64_t command, uint64_t containerClass, uint64_t user,
-              std::optional<std::string> identifier = std::nullopt) {
-    Value m = Value::dictionary();
-    m.set("Command", command);
-    m.set("ContainerClass", containerClass);
-    m.set("UserID", user);
-    if (identifier) m.set("Identifier", *identifier);
-    return m;
-}
-
-Value create(uint64_t containerClass, uint64_t user, const std::string& identifier,
-             bool transient = false, bool createIfNecessary = true) {
-    Value m = request(0, containerClass, user, identifier);
-    m.set("CreateIfNecessary", createIfNecessary);
-    m.set("Transient", transient);
-    return m;
-}
-
 Value lookUp(uint64_t containerClass, uint64_t user, const std::string& identifier) {
     return create(containerClass, user, identifier, false, false);
-}
-
-// A request about one container found by an earlier reply.
-Value about(uint64_t command, uint64_t containerClass, uint64_t user, const Value& created) {
-    Value m = request(command, containerClass, user, *created.find("ReplyIdentifier")->string());
-    m.set("UUID", *created.find("ReplyUUID"));
-    return m;
 }
 
 struct Staged {
@@ -93,28 +72,8 @@ Value stage(const Staged& s) {
     return m;
 }
 
-uint64_t code(const Value& reply) {
-    const Value* value = reply.find("ReplyError");
-    return value ? value->uint64Value().value_or(0) : 0;
-}
-
-std::string text(const Value& reply, const char* key) {
-    const Value* value = reply.find(key);
-    return value && value->string() ? *value->string() : std::string();
-}
-
 fs::path pathOf(const Value& reply) {
     return text(reply, "ReplyPath");
-}
-
-// Names in a directory, sorted.
-std::vector<std::string> listing(const fs::path& directory) {
-    std::vector<std::string> names;
-    std::error_code ignored;
-    for (const auto& entry : fs::directory_iterator(directory, ignored))
-        names.push_back(entry.path().filename().string());
-    std::sort(names.begin(), names.end());
-    return names;
 }
 
 // Every item under `top`, relative, sorted; directories end in "/".
