@@ -225,10 +225,18 @@ void Value::describe(std::string& out, int indent, bool topLevel) const {
             out.push_back('>');
             return;
         case Kind::Date: {
-            time_t seconds = static_cast<time_t>(std::floor(date()->secondsSince1970));
+            // A date read from an app's file may lie anywhere on the real
+            // line: one that no calendar time holds is shown as its seconds.
+            const double since1970 = std::floor(date()->secondsSince1970);
             struct tm tm;
-            gmtime_r(&seconds, &tm);
-            strftime(buffer, sizeof buffer, "%Y-%m-%d %H:%M:%S +0000", &tm);
+            constexpr double kLimit = 1e15;  // far inside time_t, within gmtime's years
+            const bool calendar = std::isfinite(since1970) && std::fabs(since1970) < kLimit;
+            const time_t seconds = calendar ? static_cast<time_t>(since1970) : 0;
+            if (calendar && gmtime_r(&seconds, &tm)) {
+                strftime(buffer, sizeof buffer, "%Y-%m-%d %H:%M:%S +0000", &tm);
+            } else {
+                snprintf(buffer, sizeof buffer, "%g seconds since 1970", date()->secondsSince1970);
+            }
             out += buffer;
             return;
         }

@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <cmath>
+
 #include <unordered_set>
 
 #include "core/Uuid.h"
@@ -68,6 +70,10 @@ TEST(ValueTest, DescriptionQuotesOnlyNestedStringsThatNeedIt) {
     EXPECT_EQ(d.description(), "{\n    \"a b\" = \"c d\";\n    k = v;\n}");
     EXPECT_EQ(Value(Value::Data{0xde, 0xad, 0xbe, 0xef, 1}).description(), "<deadbeef 01>");
     EXPECT_EQ(Value().description(), "(null)");
+    // Dates an app's file can hold but no calendar time can.
+    EXPECT_EQ(Value(Value::Date{0}).description(), "1970-01-01 00:00:00 +0000");
+    EXPECT_EQ(Value(Value::Date{1.15627e30}).description(), "1.15627e+30 seconds since 1970");
+    EXPECT_EQ(Value(Value::Date{-INFINITY}).description(), "-inf seconds since 1970");
 }
 
 TEST(UuidTest, ParsesCanonicalFormOnlyAndPrintsUpperCase) {
