@@ -46,6 +46,7 @@
 
 #include "BTHGlobalConfiguration.h"
 #include "BTHMetadata.h"
+#include "BenchDaemon.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
@@ -69,69 +70,8 @@ double millisecondsSince(Clock::time_point start) {
     return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
 }
 
-// One connection speaking the relay synchronously: a request, then its
-// reply. A daemon that keeps a request longer than kReplyPatience counts as
-// a broken connection.
-constexpr std::chrono::seconds kReplyPatience{30};
-
-class Client {
-  public:
-    explicit Client(const std::filesystem::path& socketPath) {
-        fd_.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-        const timeval patience{kReplyPatience.count(), 0};
-        if (::setsockopt(fd_.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience) != 0 ||
-            ::connect(fd_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
-            fd_.reset();
-    }
-    bool connected() const { return fd_.get() >= 0; }
-
-    // The reply; nullopt when the exchange failed.
-    std::optional<Value> exchange(const Value& request) {
-        frame_.clear();
-        if (!relay::encodeFrame({relay::FrameKind::Request, nextId_++, request}, frame_) ||
-            ::send(fd_.get(), frame_.data(), frame_.size(), MSG_NOSIGNAL) !=
-                static_cast<ssize_t>(frame_.size()) ||
-            !readFrame())
-            return std::nullopt;
-        Value reply;
-        if (!relay::decodeValue(
-                {reply_.data() + relay::kHeaderSize, reply_.size() - relay::kHeaderSize}, reply))
-            return std::nullopt;
-        return reply;
-    }
-
-    // The reply's "ReplyError"; 0 when the exchange failed.
-    uint64_t call(const Value& request) {
-        const std::optional<Value> reply = exchange(request);
-        const Value* code = reply ? reply->find("ReplyError") : nullptr;
-        return code ? code->uint64Value().value_or(0) : 0;
-    }
-
-  private:
-    bool readExactly(uint8_t* into, size_t size) {
-        for (size_t done = 0; done < size;) {
-            const ssize_t got = ::read(fd_.get(), into + done, size - done);
-            if (got <= 0) return false;
-            done += static_cast<size_t>(got);
-        }
-        return true;
-    }
-    bool readFrame() {
-        reply_.resize(relay::kHeaderSize);
-        if (!readExactly(reply_.data(), relay::kHeaderSize)) return false;
-        uint32_t length = 0;
-        for (int i = 0; i < 4; ++i) length |= uint32_t(reply_[12 + i]) << (8 * i);
-        reply_.resize(relay::kHeaderSize + length);
-        return readExactly(reply_.data() + relay::kHeaderSize, length);
-    }
-
-    UniqueFd fd_;
-    uint64_t nextId_ = 1;
-    std::vector<uint8_t> frame_, reply_;
-};
+using bench::BenchClient;
+using bench::BenchDaemon;
 
 Value lookupRequest(uint64_t containerClass, const std::string& identifier, bool create) {
     Value request = Value::dictionary();
@@ -148,69 +88,13 @@ std::string rebuiltIdentifier(uint64_t index) {
     return "sys.kelp.bench.existing." + std::to_string(index);
 }
 
-// A berthd serving `root`; killed when the object goes.
-class Daemon {
-  public:
-    Daemon(const std::filesystem::path& binary, const std::filesystem::path& root)
-        : socket_(root / "run/berthd/sys.kelp.berthd") {
-        const std::filesystem::path output = root / "berthd.output";
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            const int fd = ::open(output.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
-            ::dup2(fd, STDOUT_FILENO);
-            ::dup2(fd, STDERR_FILENO);
-            ::execl(binary.c_str(), binary.c_str(), nullptr);
-            _exit(127);
-        }
-        for (int i = 0; i < 1000; ++i) {
-            if (Client(socket_).connected()) return;
-            if (::waitpid(pid_, nullptr, WNOHANG) == pid_)
-                die("berthd ended; see " + output.string());
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        }
-        stop();
-        die("berthd did not start serving; see " + output.string());
-    }
-    ~Daemon() { stop(); }
-    const std::filesystem::path& socket() const { return socket_; }
-
-  private:
-    void stop() {
-        ::kill(pid_, SIGKILL);
-        ::waitpid(pid_, nullptr, 0);
-        std::error_code ignored;
-        std::filesystem::remove(socket_, ignored);  // the next start must not find it early
-    }
-
-    std::filesystem::path socket_;
-    pid_t pid_ = -1;
-};
-
 // The accounts and homes of a device root, and this program signed in its
 // registry as a client that may act on other identifiers.
 void prepareRoot(const std::filesystem::path& root) {
-    std::filesystem::create_directories(root / "etc");
-    std::ofstream(root / "etc/passwd") << "root:x:0:0::/private/var/root:/bin/sh\n"
-                                          "_bundles:x:33:33::/private/var/ladingd:/bin/false\n"
-                                          "_system:x:499:499::/private/var/empty:/bin/false\n"
-                                          "mobile:x:501:501::/private/var/mobile:/bin/sh\n";
-    std::ofstream(root / "etc/group") << "root:x:0:\n_bundles:x:33:\n_system:x:499:\n"
-                                         "systemusers:x:510:_system\nmobile:x:501:\n";
-    std::ofstream(root / "etc/os-release") << "VERSION_ID=0.1\nBUILD_ID=bench-1\n";
-    for (const auto& [home, owner] : {std::pair<const char*, uid_t>{"private/var/root", 0},
-                                      {"private/var/ladingd", 33},
-                                      {"private/var/empty", 499},
-                                      {"private/var/mobile", 501}}) {
-        std::filesystem::create_directories(root / home);
-        if (::chown((root / home).c_str(), owner, owner) != 0) die("chown " + std::string(home));
-    }
     Value entitlements = Value::dictionary();
     entitlements.set("sys.kelp.private.Berth.otherIdLookup", true);
     entitlements.set("sys.kelp.private.Berth.allowed", true);  // the listing that checks the map
-    std::string why;
-    if (CodeSigningRegistry().sign(std::filesystem::read_symlink("/proc/self/exe"),
-                                   "sys.kelp.bench.containers", entitlements, &why) != 0)
-        die("sign: " + why);
+    bench::prepareBenchRoot(root, "sys.kelp.bench.containers", entitlements);
 }
 
 // Writes `count` containers of user 501's Data/Application class directly
@@ -246,7 +130,7 @@ struct Rebuild {
 };
 
 // The number of containers command 1 lists for the class.
-size_t listedContainers(Client& client) {
+size_t listedContainers(BenchClient& client) {
     Value request = Value::dictionary();
     request.set("Command", uint64_t{1});
     request.set("ContainerClass", kDataApplication);
@@ -262,8 +146,8 @@ size_t listedContainers(Client& client) {
 // that the map holds every container written (that each file validated).
 Rebuild timeRebuild(const std::filesystem::path& binary, const std::filesystem::path& root,
                     uint64_t count, bool verify) {
-    Daemon daemon(binary, root);
-    Client client(daemon.socket());
+    BenchDaemon daemon(binary, root);
+    BenchClient client(daemon.socket());
     client.call(lookupRequest(kDataSprocketPlugin, "sys.kelp.bench.warm-up", false));
     Rebuild result;
     auto start = Clock::now();
@@ -302,7 +186,7 @@ Throughput measure(const std::filesystem::path& socket, int clients, double seco
     std::vector<std::thread> threads;
     for (int c = 0; c < clients; ++c) {
         threads.emplace_back([&, c] {
-            Client client(socket);
+            BenchClient client(socket);
             std::vector<double>& mine = latencies[c];
             for (uint64_t n = 0; !stop.load(std::memory_order_relaxed); ++n) {
                 const Value request = makeRequest(c, n);
@@ -377,7 +261,7 @@ void run(const Settings& settings, const std::filesystem::path& root) {
                 rebuilds.front().firstMilliseconds, median.nextMilliseconds,
                 median.firstMilliseconds / median.nextMilliseconds);
 
-    Daemon daemon(settings.berthd, root);
+    BenchDaemon daemon(settings.berthd, root);
     std::printf("%-8s %7s %12s %10s %10s\n", "workload", "clients", "requests/s", "p50 us",
                 "p99 us");
     for (int clients : {1, 8}) {

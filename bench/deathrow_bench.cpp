@@ -36,9 +36,8 @@
 #include <thread>
 #include <vector>
 
+#include "BenchDaemon.h"
 #include "core/RelayCodec.h"
-#include "platform/CodeSigningRegistry.h"
-#include "platform/NamedSemaphore.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -101,78 +100,38 @@ void buildTree(const fs::path& top, int files) {
 }
 
 // A berthd serving `root`, this program signed into the root's registry as
-// a client holding ".allowed"; killed when the object goes.
+// a client holding ".allowed", and one connection to it; killed when the
+// object goes.
 class Daemon {
   public:
-    Daemon(const fs::path& binary, const fs::path& root) {
-        fs::create_directories(root / "etc");
-        for (const char* home : {"private/var/root", "private/var/mobile"})
-            fs::create_directories(root / home);
-        FILE* passwd = std::fopen((root / "etc/passwd").c_str(), "w");
-        if (!passwd) die("etc/passwd");
-        std::fputs(
-            "root:x:0:0::/private/var/root:/bin/sh\n"
-            "mobile:x:501:501::/private/var/mobile:/bin/sh\n",
-            passwd);
-        std::fclose(passwd);
-        Value entitlements = Value::dictionary();
-        entitlements.set("sys.kelp.private.Berth.allowed", true);
-        std::string why;
-        if (CodeSigningRegistry().sign(fs::read_symlink("/proc/self/exe"),
-                                       "sys.kelp.bench.deathrow", entitlements, &why) != 0)
-            die("sign: " + why);
-        const std::string errors = (root / "berthd.stderr").string();
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            const int fd = ::open(errors.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-            if (fd >= 0) ::dup2(fd, STDERR_FILENO);
-            ::execl(binary.c_str(), binary.c_str(), nullptr);
-            _exit(127);
-        }
-        const fs::path socketPath = root / "run/berthd/sys.kelp.berthd";
-        for (int i = 0; i < 1000 && !socket_; ++i) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(20));
-            UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-            sockaddr_un address{};
-            address.sun_family = AF_UNIX;
-            std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
-            if (::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) == 0)
-                socket_ = std::move(fd);
-        }
-        if (!socket_) die("berthd did not start; see " + errors);
-    }
-    ~Daemon() {
-        ::kill(pid_, SIGKILL);
-        ::waitpid(pid_, nullptr, 0);
-        NamedSemaphore::remove("berthd.fb_check");  // the scratch root's marker
+    Daemon(const fs::path& binary, const fs::path& root)
+        : prepared_(prepare(root)), daemon_(binary, root), client_(daemon_.socket(), kPatience) {
+        if (!client_.connected()) die("cannot connect to berthd");
     }
 
-    pid_t pid() const { return pid_; }
+    pid_t pid() const { return daemon_.pid(); }
 
     // Sends `request` and waits for its reply; returns "ReplyError".
     uint64_t call(const Value& request) {
-        std::vector<uint8_t> frame;
-        relay::encodeFrame({relay::FrameKind::Request, ++messageId_, request}, frame);
-        if (::send(socket_.get(), frame.data(), frame.size(), MSG_NOSIGNAL) !=
-            static_cast<ssize_t>(frame.size()))
-            die("send");
-        relay::FrameDecoder decoder;
-        uint8_t buffer[4096];
-        relay::Frame reply;
-        while (decoder.next(reply) != relay::FrameDecoder::Status::Frame) {
-            if (decoder.failed()) die("bad reply");
-            const ssize_t got = ::read(socket_.get(), buffer, sizeof buffer);
-            if (got <= 0) die("daemon closed the connection");
-            decoder.feed({buffer, static_cast<size_t>(got)});
-        }
-        const Value* code = reply.body.find("ReplyError");
-        return code ? code->uint64Value().value_or(0) : 0;
+        const uint64_t code = client_.call(request);
+        if (code == 0) die("no reply from berthd");
+        return code;
     }
 
   private:
-    pid_t pid_ = -1;
-    UniqueFd socket_;
-    uint64_t messageId_ = 0;
+    // Emptying a large death row takes minutes on a slow disk.
+    static constexpr std::chrono::seconds kPatience{900};
+
+    static bool prepare(const fs::path& root) {
+        Value entitlements = Value::dictionary();
+        entitlements.set("sys.kelp.private.Berth.allowed", true);
+        bench::prepareBenchRoot(root, "sys.kelp.bench.deathrow", entitlements);
+        return true;
+    }
+
+    bool prepared_;  // the root is ready before the daemon starts on it
+    bench::BenchDaemon daemon_;
+    bench::BenchClient client_;
 };
 
 Value emptyDeathRowRequest() {

@@ -37,6 +37,7 @@
 #include <thread>
 #include <vector>
 
+#include "BenchDaemon.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
@@ -213,45 +214,20 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
 // registry; stopped when the object goes.
 class Daemon {
   public:
-    Daemon(const std::filesystem::path& binary, const std::filesystem::path& root) {
-        std::filesystem::create_directories(root / "etc");
-        std::filesystem::create_directories(root / "private/var/mobile");
-        std::filesystem::create_directories(root / "private/var/root");
-        FILE* passwd = std::fopen((root / "etc/passwd").c_str(), "w");
-        std::fputs(
-            "root:x:0:0::/private/var/root:/bin/sh\n"
-            "mobile:x:501:501::/private/var/mobile:/bin/sh\n",
-            passwd);
-        std::fclose(passwd);
-        Value entitlements = Value::dictionary();
-        entitlements.set("sys.kelp.private.Berth.allowed", true);
-        std::string why;
-        CodeSigningRegistry registry;
-        if (registry.sign(std::filesystem::read_symlink("/proc/self/exe"), "sys.kelp.bench.client",
-                          entitlements, &why) != 0) {
-            std::fprintf(stderr, "sign: %s\n", why.c_str());
-            std::exit(1);
-        }
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            ::execl(binary.c_str(), binary.c_str(), nullptr);
-            _exit(127);
-        }
-        socket_ = root / "run/berthd/sys.kelp.berthd";
-        for (int i = 0; i < 500 && !std::filesystem::exists(socket_); ++i)
-            std::this_thread::sleep_for(std::chrono::milliseconds(20));
-        std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    }
-    ~Daemon() {
-        ::kill(pid_, SIGKILL);
-        ::waitpid(pid_, nullptr, 0);
-        NamedSemaphore::remove("berthd.fb_check");  // the scratch root's marker
-    }
-    const std::filesystem::path& socket() const { return socket_; }
+    Daemon(const std::filesystem::path& binary, const std::filesystem::path& root)
+        : prepared_(prepare(root)), daemon_(binary, root) {}
+    const std::filesystem::path& socket() const { return daemon_.socket(); }
 
   private:
-    pid_t pid_ = -1;
-    std::filesystem::path socket_;
+    static bool prepare(const std::filesystem::path& root) {
+        Value entitlements = Value::dictionary();
+        entitlements.set("sys.kelp.private.Berth.allowed", true);
+        bench::prepareBenchRoot(root, "sys.kelp.bench.client", entitlements);
+        return true;
+    }
+
+    bool prepared_;  // the root is ready before the daemon starts on it
+    bench::BenchDaemon daemon_;
 };
 
 UniqueFd claim(const std::filesystem::path& dir, const std::string& name) {
