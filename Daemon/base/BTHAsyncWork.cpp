@@ -13,4 +13,16 @@ void BTHPerformAsyncWork(const std::shared_ptr<WorkQueue>& queue, std::function<
     });
 }
 
+const std::shared_ptr<WorkQueue>& BTHDeathRowQueue() {
+    static const std::shared_ptr<WorkQueue> queue =
+        WorkQueue::makeSerial("sys.kelp.berthd.deathrow", QueuePriority::background);
+    return queue;
+}
+
+const std::shared_ptr<WorkQueue>& BTHLockStateQueue() {
+    static const std::shared_ptr<WorkQueue> queue =
+        WorkQueue::makeSerial("sys.kelp.berthd.lockstate");
+    return queue;
+}
+
 }  // namespace berth

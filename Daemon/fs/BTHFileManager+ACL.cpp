@@ -29,7 +29,7 @@
 
 #include "BTHFileManager+Internal.h"
 #include "BTHFileManager.h"
-#include "BTHMetadata.h"
+#include "core/BTHContainerClass.h"
 #include "platform/SafeFs.h"
 #include "platform/UserDatabase.h"
 

@@ -4,7 +4,6 @@
 // is still there when the daemon stops is destroyed after its next start.
 #include "BTHAsyncWork.h"
 #include "BTHClientConnection.h"
-#include "BTHDaemon.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLog.h"

@@ -7,11 +7,11 @@
 #include "BTHClientConnection.h"
 #include "BTHCodeSigningMapping.h"
 #include "BTHContainerCache.h"
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLocks.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

@@ -3,10 +3,10 @@
 // class, identifier and UUID, under that container's identifier lock.
 #include "BTHClientConnection.h"
 #include "BTHContainerCache.h"
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHLocks.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

@@ -2,12 +2,12 @@
 // while its internal UUID, identifier, class and contents stay the same.
 #include "BTHClientConnection.h"
 #include "BTHContainerCache.h"
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLocks.h"
 #include "BTHLog.h"
 #include "BTHWhitelist.h"
+#include "core/BTHContainerClass.h"
 #include "platform/DeviceProperties.h"
 
 namespace berth {

@@ -19,13 +19,13 @@
 #include "BTHClientConnection.h"
 #include "BTHCodeSigningMapping.h"
 #include "BTHContainerCache.h"
-#include "BTHContainerClass.h"
 #include "BTHFaultInjection.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLocks.h"
 #include "BTHLog.h"
 #include "BTHPropertyListFile.h"
+#include "core/BTHContainerClass.h"
 #include "platform/SafeFs.h"
 
 namespace berth {

@@ -4,9 +4,9 @@
 #include <string_view>
 #include <utility>
 
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

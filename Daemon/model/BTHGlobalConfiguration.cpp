@@ -1,8 +1,8 @@
 #include "BTHGlobalConfiguration.h"
 
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 #include "platform/DeviceRoot.h"
 #include "platform/UserDatabase.h"
 

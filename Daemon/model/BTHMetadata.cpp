@@ -3,9 +3,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "BTHContainerClass.h"
 #include "BTHFaultInjection.h"
 #include "BTHPropertyListFile.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

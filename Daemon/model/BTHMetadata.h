@@ -37,12 +37,11 @@
 #include <string>
 
 #include "BTHError.h"
+#include "core/BTHContainerClass.h"
 #include "core/Uuid.h"
 #include "core/Value.h"
 
 namespace berth {
-
-inline constexpr const char* kBTHMetadataFileName = ".sys.kelp.berth.metadata.plist";
 
 inline constexpr const char* kBTHMetadataIdentifierKey = "BTHMetadataIdentifier";
 inline constexpr const char* kBTHMetadataUUIDKey = "BTHMetadataUUID";

@@ -3,9 +3,9 @@
 #include <climits>
 #include <cstdlib>
 
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 #include "platform/DeviceRoot.h"
 #include "platform/UserDatabase.h"
 

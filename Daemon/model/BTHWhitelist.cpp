@@ -2,7 +2,7 @@
 
 #include <utility>
 
-#include "BTHContainerClass.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

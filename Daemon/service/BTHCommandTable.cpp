@@ -14,48 +14,45 @@ void commandNotAvailable(const BTHRequestRef&, const std::shared_ptr<BTHClientCo
     BTHSetErrorCode(replyError, BTHErrorInvalidCommand);
 }
 
-constexpr BTHCommandRow row(uint64_t command, const char* name, const char* entitlement,
-                            uint32_t repliesAtOnce = 1,
-                            BTHCommandHandler handler = commandNotAvailable) {
-    return BTHCommandRow{command, name, handler, entitlement, repliesAtOnce, 0};
+// The handlers built into the daemon, by command number: the one place a new
+// command is plugged in.
+constexpr struct {
+    uint64_t command;
+    BTHCommandHandler handler;
+} kHandlers[] = {
+    {0, createOrLookupContainer},
+    {1, listContainers},
+    {2, replaceContainer},
+    {3, stageContainerForDelete},
+    {4, deleteContainersOnDeathRow},
+    {5, setInfoValue},
+    {6, getInfoValue},
+    {7, getContainerMetadata},
+    {8, recreateDefaultStructure},
+    {9, regenerateDirectoryUUID},
+    {10, deleteContainer},
+    {11, wipePluginDataContainer},
+    {12, wipeDataContainer},
+    {22, recreateDefaultStructure},
+};
+
+BTHCommandHandler handlerOf(uint64_t command) {
+    for (const auto& entry : kHandlers)
+        if (entry.command == command) return entry.handler;
+    return commandNotAvailable;
 }
 
 }  // namespace
 
 const std::array<BTHCommandRow, kBTHCommandCount>& BTHCommandTable() {
-    static const std::array<BTHCommandRow, kBTHCommandCount> table{{
-        row(0, "createOrLookupContainer", kBTHEntitlementNone, 1, createOrLookupContainer),
-        row(1, "listContainers", kBTHEntitlementAllowed, 1, listContainers),
-        row(2, "replaceContainer", kBTHEntitlementAllowed, 1, replaceContainer),
-        row(3, "stageContainerForDelete", kBTHEntitlementAllowed, 1, stageContainerForDelete),
-        row(4, "deleteContainersOnDeathRow", kBTHEntitlementAllowed, 0, deleteContainersOnDeathRow),
-        row(5, "setInfoValue", kBTHEntitlementAllowed, 1, setInfoValue),
-        row(6, "getInfoValue", kBTHEntitlementAllowed, 1, getInfoValue),
-        row(7, "getContainerMetadata", kBTHEntitlementAllowed, 1, getContainerMetadata),
-        row(8, "recreateDefaultStructure", kBTHEntitlementAllowed, 1, recreateDefaultStructure),
-        row(9, "regenerateDirectoryUUID", kBTHEntitlementAllowed, 1, regenerateDirectoryUUID),
-        row(10, "deleteContainer", kBTHEntitlementAllowed, 1, deleteContainer),
-        row(11, "wipePluginDataContainer", kBTHEntitlementWipeContainer, 1,
-            wipePluginDataContainer),
-        row(12, "wipeDataContainer", kBTHEntitlementAllowed, 1, wipeDataContainer),
-        row(13, "groupContainerPaths", kBTHEntitlementNone),
-        row(14, "groupContainerIdentifiers", kBTHEntitlementAllowed),
-        row(15, "systemContainerPath", kBTHEntitlementNone),
-        row(16, "systemGroupContainerPaths", kBTHEntitlementNone),
-        row(17, "systemGroupContainerPath", kBTHEntitlementNone),
-        row(18, "processCodeSigningInfo", kBTHEntitlementAllowed),
-        row(19, "getCodeSigningInfo", kBTHEntitlementAllowed),
-        row(20, "invalidateCodeSigningInfo", kBTHEntitlementAllowed),
-        row(21, "setDataProtection", kBTHEntitlementAllowed, 0),
-        row(22, "recreateDefaultStructure", kBTHEntitlementAllowed, 1, recreateDefaultStructure),
-        row(23, "diskUsage", kBTHEntitlementAllowed),
-        row(24, "performDataMigration", kBTHEntitlementDataMigration),
-        row(25, "retryTest", kBTHEntitlementAllowed),
-        row(26, "stageSharedContent", kBTHEntitlementStageSharedContent),
-        row(27, "setNetworkExtension", kBTHEntitlementNetworkExtension),
-        row(28, "userManagedAssetsPath", kBTHEntitlementUserManagedAssets),
-        row(29, "deleteUserManagedAsset", kBTHEntitlementUserManagedAssets),
-    }};
+    static const std::array<BTHCommandRow, kBTHCommandCount> table = [] {
+        std::array<BTHCommandRow, kBTHCommandCount> rows{};
+        for (const BTHCommandInfo& info : BTHCommands())
+            rows[info.command] = BTHCommandRow{
+                info.command,       info.name, handlerOf(info.command), info.requiredEntitlement,
+                info.repliesAtOnce, 0};
+        return rows;
+    }();
     return table;
 }
 

@@ -1,7 +1,7 @@
-// The 30 commands of the request socket, indexed by command number: the
-// handler, the entitlement the caller needs, and whether the request
-// processor replies when the handler returns (1) or the handler's completion
-// does (0).
+// The daemon's command table: the shared command rows (number, name,
+// required entitlement, when the reply goes) each paired with its handler,
+// indexed by command number. A command whose operation is not built into the
+// daemon answers BTHErrorInvalidCommand (49) after its entitlement check.
 #pragma once
 
 #include <array>
@@ -10,20 +10,9 @@
 
 #include "BTHClientConnection.h"
 #include "BTHRequest.h"
+#include "core/Commands.h"
 
 namespace berth {
-
-inline constexpr const char* kBTHEntitlementNone = "sys.kelp.private.Berth.none";
-inline constexpr const char* kBTHEntitlementAllowed = "sys.kelp.private.Berth.allowed";
-inline constexpr const char* kBTHEntitlementOtherIdLookup = "sys.kelp.private.Berth.otherIdLookup";
-inline constexpr const char* kBTHEntitlementWipeContainer = "sys.kelp.private.Berth.wipeContainer";
-inline constexpr const char* kBTHEntitlementDataMigration = "sys.kelp.private.Berth.dataMigration";
-inline constexpr const char* kBTHEntitlementStageSharedContent =
-    "sys.kelp.private.Berth.stageSharedContent";
-inline constexpr const char* kBTHEntitlementNetworkExtension =
-    "sys.kelp.private.Berth.networkExtension";
-inline constexpr const char* kBTHEntitlementUserManagedAssets =
-    "sys.kelp.private.Berth.userManagedAssets";
 
 // Reads its keys from the request, calls one operation, adds its reply keys,
 // and writes a failure code through `replyError` (which starts at 1).
@@ -39,8 +28,6 @@ struct BTHCommandRow {
     uint32_t repliesAtOnce;
     uint32_t spare;
 };
-
-inline constexpr uint64_t kBTHCommandCount = 30;
 
 const std::array<BTHCommandRow, kBTHCommandCount>& BTHCommandTable();
 

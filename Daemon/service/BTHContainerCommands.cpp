@@ -1,10 +1,10 @@
 #include "BTHContainerCommands.h"
 
 #include "BTHCommandTable.h"
-#include "BTHContainerClass.h"
 #include "BTHLog.h"
 #include "BTHRequestIntake.h"
 #include "BTHRequestReaders.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

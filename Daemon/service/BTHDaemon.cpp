@@ -10,6 +10,7 @@
 #include <cstring>
 #include <optional>
 
+#include "BTHAsyncWork.h"
 #include "BTHClientConnection.h"
 #include "BTHError.h"
 #include "BTHGlobalConfiguration.h"
@@ -121,18 +122,6 @@ std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& l
 
 uint32_t BTHLogFileCount() {
     return gLogFileCount;
-}
-
-const std::shared_ptr<WorkQueue>& BTHDeathRowQueue() {
-    static const std::shared_ptr<WorkQueue> queue =
-        WorkQueue::makeSerial("sys.kelp.berthd.deathrow", QueuePriority::background);
-    return queue;
-}
-
-const std::shared_ptr<WorkQueue>& BTHLockStateQueue() {
-    static const std::shared_ptr<WorkQueue> queue =
-        WorkQueue::makeSerial("sys.kelp.berthd.lockstate");
-    return queue;
 }
 
 int BTHDaemonMain() {

@@ -1,5 +1,4 @@
-// Start-up and the main loop of berthd, and the queues and globals every
-// part of the daemon shares.
+// Start-up and the main loop of berthd.
 //
 // The daemon opens its rotating log, creates its queues, does the
 // once-per-boot and every-launch work of the container store, starts the
@@ -26,11 +25,5 @@ int BTHDaemonMain();
 
 // The number of rotated log files kept: 1, or 4 on internal builds.
 uint32_t BTHLogFileCount();
-
-// "sys.kelp.berthd.deathrow": serial, background priority; empties death row.
-const std::shared_ptr<WorkQueue>& BTHDeathRowQueue();
-
-// "sys.kelp.berthd.lockstate": serial, suspended while the device is locked.
-const std::shared_ptr<WorkQueue>& BTHLockStateQueue();
 
 }  // namespace berth

@@ -1,10 +1,10 @@
 #include "BTHRequestIntake.h"
 
 #include "BTHCommandTable.h"
-#include "BTHContainerClass.h"
 #include "BTHError.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

@@ -4,8 +4,8 @@
 #include <iostream>
 #include <string>
 
-#include "BTHCommandTable.h"
 #include "ExitStatus.h"
+#include "core/Commands.h"
 #include "core/ValueJson.h"
 
 namespace berth::ctl {
@@ -14,7 +14,7 @@ namespace {
 
 size_t widestName() {
     size_t width = 0;
-    for (const auto& row : BTHCommandTable()) width = std::max(width, std::string(row.name).size());
+    for (const auto& row : BTHCommands()) width = std::max(width, std::string(row.name).size());
     return width;
 }
 
@@ -23,7 +23,7 @@ size_t widestName() {
 int runListCommands(bool json, std::ostream& out) {
     if (json) {
         Value rows = Value::array();
-        for (const auto& row : BTHCommandTable()) {
+        for (const auto& row : BTHCommands()) {
             Value value = Value::dictionary();
             value.set("command", row.command);
             value.set("name", row.name);
@@ -38,7 +38,7 @@ int runListCommands(bool json, std::ostream& out) {
     const int nameWidth = static_cast<int>(widestName());
     out << std::left << std::setw(4) << "No." << std::setw(nameWidth + 2) << "Command"
         << "Required entitlement\n";
-    for (const auto& row : BTHCommandTable()) {
+    for (const auto& row : BTHCommands()) {
         const std::string entitlement = row.requiredEntitlement;
         out << std::left << std::setw(4) << row.command << std::setw(nameWidth + 2) << row.name
             << (entitlement == kBTHEntitlementNone ? "(any caller)" : entitlement) << "\n";

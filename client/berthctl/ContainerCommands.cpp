@@ -5,8 +5,8 @@
 #include <charconv>
 #include <iostream>
 
-#include "BTHContainerClass.h"
 #include "ExitStatus.h"
+#include "core/BTHContainerClass.h"
 #include "core/ValueJson.h"
 #include "libberth/BerthContainers.h"
 

@@ -1,4 +1,4 @@
-#include "BTHContainerClass.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 

@@ -63,6 +63,11 @@ inline constexpr bool BTHContainerClassIsPerUser(uint64_t c) {
     return BTHContainerClassIsValid(c) && !BTHContainerClassIsGlobal(c);
 }
 
+// The file inside every container that holds its metadata record. The file
+// operations leave it alone when they standardize a container's contents, so
+// it is part of the layout every layer knows.
+inline constexpr const char* kBTHMetadataFileName = ".sys.kelp.berth.metadata.plist";
+
 // The only user a global class admits (33 or 499); for per-user and invalid
 // classes, nullopt-like 0.
 inline constexpr uid_t BTHContainerClassGlobalUser(uint64_t c) {

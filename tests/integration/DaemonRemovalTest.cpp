@@ -18,7 +18,7 @@
 #include <thread>
 
 #include "DaemonSupport.h"
-#include "client/libberth/BerthConnection.h"
+#include "libberth/BerthConnection.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
 #include "platform/UniqueFd.h"

@@ -16,7 +16,7 @@
 #include "DaemonProcess.h"
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
-#include "client/libberth/BerthConnection.h"
+#include "libberth/BerthConnection.h"
 
 namespace berth::test {
 

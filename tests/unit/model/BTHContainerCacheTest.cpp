@@ -2,11 +2,11 @@
 
 #include <cctype>
 
-#include "BTHContainerClass.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 namespace {

@@ -2,9 +2,9 @@
 
 #include <sys/xattr.h>
 
-#include "BTHContainerClass.h"
 #include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 namespace {

@@ -1,0 +1,2 @@
+// Must not compile: the client sees no daemon header (tests/layering).
+#include "BTHCommandTable.h"
