@@ -9,6 +9,7 @@
 
 #include <sys/types.h>
 
+#include <atomic>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
@@ -73,10 +74,16 @@ class BTHClientConnection {
         return clientBundleIdentifier_;
     }
     uid_t clientUserId() const { return clientUserId_; }
-    bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
-    void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
-    bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
-    void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
+    // The daemon's own object gains these rights while requests run on it
+    // (the upcall sets them), so they are read and set atomically.
+    bool allowOtherIdLookup() const { return allowOtherIdLookup_.load(std::memory_order_relaxed); }
+    void setAllowOtherIdLookup(bool allow) {
+        allowOtherIdLookup_.store(allow, std::memory_order_relaxed);
+    }
+    bool allowGroupIdLookup() const { return allowGroupIdLookup_.load(std::memory_order_relaxed); }
+    void setAllowGroupIdLookup(bool allow) {
+        allowGroupIdLookup_.store(allow, std::memory_order_relaxed);
+    }
     const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const {
         return entitledWipeIdentifiers_;
     }
@@ -232,8 +239,8 @@ class BTHClientConnection {
 
     std::optional<std::string> clientBundleIdentifier_;
     uid_t clientUserId_ = 0;
-    bool allowOtherIdLookup_ = false;
-    bool allowGroupIdLookup_ = false;
+    std::atomic<bool> allowOtherIdLookup_{false};
+    std::atomic<bool> allowGroupIdLookup_{false};
     std::optional<std::vector<std::string>> entitledWipeIdentifiers_;
 };
 

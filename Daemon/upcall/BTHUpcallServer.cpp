@@ -3,55 +3,36 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
 #include "BTHLog.h"
+#include "BTHUpcallDemux.h"
+#include "platform/UpcallTransport.h"
 
 namespace berth {
 
 namespace {
 
-constexpr uint32_t kComplexBit = 0x80000000u;
-constexpr uint32_t kReplyPortDispositionMask = 0x1f;
-// Native data representation: integers little-endian, the rest zero.
-constexpr uint8_t kNativeDataRecord[8] = {0, 0, 0, 0, 1, 0, 0, 0};
-// Room for the request and a pack buffer descriptor that rides along.
+// Room for a request and then some, so that an oversized message is seen as
+// such rather than cut to size.
 constexpr size_t kReceiveBufferSize = 256;
 
-uint32_t field(const uint8_t* message, size_t offset) {
-    uint32_t value;
-    std::memcpy(&value, message + offset, sizeof value);
-    return value;
-}
-
-void putField(std::vector<uint8_t>& message, size_t offset, uint32_t value) {
-    std::memcpy(message.data() + offset, &value, sizeof value);
-}
-
-// Receives one message; descriptors passed with it are closed at once (none
-// is needed to give an error reply). -1 on end of stream or error.
-ssize_t receive(int fd, uint8_t* buffer, size_t size) {
-    alignas(struct cmsghdr) char control[CMSG_SPACE(sizeof(int) * 4)];
-    struct iovec iov {
-        buffer, size
-    };
-    struct msghdr message {};
-    message.msg_iov = &iov;
-    message.msg_iovlen = 1;
-    message.msg_control = control;
-    message.msg_controllen = sizeof control;
-    ssize_t n = ::recvmsg(fd, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
-    for (struct cmsghdr* c = CMSG_FIRSTHDR(&message); c; c = CMSG_NXTHDR(&message, c)) {
-        if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-        size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-        for (size_t i = 0; i < count; ++i) {
-            int passed;
-            std::memcpy(&passed, CMSG_DATA(c) + i * sizeof(int), sizeof passed);
-            ::close(passed);
-        }
-    }
-    return n;
+// The audit trailer the kernel interface appends: type 0, its size, and the
+// sender's audit token. A sender running as root plays the kernel (process
+// id 0); any other sender is named by its real process id.
+void appendTrailer(BTHUpcallRequestMessage& request, const struct ucred& sender) {
+    uint8_t* m = request.bytes.data();
+    BTHUpcallSetField(m, upcall::kTrailerType, 0);
+    BTHUpcallSetField(m, upcall::kTrailerSize, kBTHUpcallTrailerSize);
+    BTHUpcallSetField(m, upcall::kAuditToken, sender.uid);
+    BTHUpcallSetField(m, upcall::kAuditTokenEffectiveUser, sender.uid);
+    BTHUpcallSetField(m, upcall::kAuditToken + 8, sender.gid);
+    BTHUpcallSetField(m, upcall::kAuditToken + 12, sender.uid);
+    BTHUpcallSetField(m, upcall::kAuditToken + 16, sender.gid);
+    BTHUpcallSetField(m, upcall::kAuditTokenProcessId,
+                      sender.uid == 0 ? 0u : static_cast<uint32_t>(sender.pid));
 }
 
 }  // namespace
@@ -59,12 +40,17 @@ ssize_t receive(int fd, uint8_t* buffer, size_t size) {
 std::vector<uint8_t> BTHUpcallErrorReply(const uint8_t* request, size_t size, int32_t code) {
     std::vector<uint8_t> reply(kBTHUpcallErrorReplySize, 0);
     if (size < 24) return reply;
-    putField(reply, 0, field(request, 0) & kReplyPortDispositionMask & ~kComplexBit);
-    putField(reply, 4, kBTHUpcallErrorReplySize);
-    putField(reply, 8, field(request, 8));
-    putField(reply, 20, field(request, 20) + kBTHUpcallReplyIdOffset);
-    std::memcpy(reply.data() + 24, kNativeDataRecord, sizeof kNativeDataRecord);
-    putField(reply, 32, static_cast<uint32_t>(code));
+    uint8_t* r = reply.data();
+    BTHUpcallSetField(r, upcall::kBits,
+                      BTHUpcallField(request, upcall::kBits) & kBTHUpcallReplyPortDispositionMask &
+                          ~kBTHUpcallComplexBit);
+    BTHUpcallSetField(r, upcall::kSize, kBTHUpcallErrorReplySize);
+    BTHUpcallSetField(r, upcall::kRemotePort, BTHUpcallField(request, upcall::kRemotePort));
+    BTHUpcallSetField(r, upcall::kId,
+                      BTHUpcallField(request, upcall::kId) + kBTHUpcallReplyIdOffset);
+    std::memcpy(r + upcall::kErrorDataRecord, kBTHUpcallNativeDataRecord.data(),
+                kBTHUpcallNativeDataRecord.size());
+    BTHUpcallSetField(r, upcall::kErrorReturnCode, static_cast<uint32_t>(code));
     return reply;
 }
 
@@ -114,7 +100,8 @@ void BTHUpcallServer::accept() {
 void BTHUpcallServer::serve(int fd) {
     BTH_FUNCTION("demux_server");
     uint8_t buffer[kReceiveBufferSize];
-    ssize_t n = receive(fd, buffer, sizeof buffer);
+    UniqueFd attached;
+    const ssize_t n = BTHUpcallReceive(fd, buffer, sizeof buffer, &attached, MSG_DONTWAIT);
     if (n < 0 && (errno == EAGAIN || errno == EINTR)) return;
     if (n <= 0) {
         close(fd);
@@ -124,12 +111,38 @@ void BTHUpcallServer::serve(int fd) {
         BTHLogError("Upcall message of %zd bytes is too short to answer", n);
         return;
     }
-    const uint32_t id = field(buffer, 20);
-    const int32_t code = id == kBTHUpcallRequestId ? kBTHUpcallCannotServe : kBTHUpcallBadMessageId;
-    BTHLogDebug("berth server returns: %d", code);
-    std::vector<uint8_t> reply = BTHUpcallErrorReply(buffer, static_cast<size_t>(n), code);
-    if (::send(fd, reply.data(), reply.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0)
-        BTHLogError("Failed to send the upcall reply: %s", strerror(errno));
+    struct ucred sender {};
+    socklen_t length = sizeof sender;
+    if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &sender, &length) != 0) {
+        BTHLogError("Failed to read the upcall sender's credentials: %s", strerror(errno));
+        close(fd);
+        return;
+    }
+
+    // As the kernel does: the header's size is what arrived, then the trailer.
+    BTHUpcallRequestMessage request;
+    std::memcpy(request.bytes.data(), buffer, std::min<size_t>(n, kBTHUpcallRequestSize));
+    BTHUpcallSetField(request.bytes.data(), upcall::kSize, static_cast<uint32_t>(n));
+    appendTrailer(request, sender);
+    if (attached) {
+        int error = 0;
+        request.data = OutOfLineMemory::adopt(
+            std::move(attached), BTHUpcallField(request.bytes.data(), upcall::kDataSize), &error);
+        if (!request.data) BTHLogError("Upcall request memory cannot be read: %s", strerror(error));
+    }
+
+    BTHUpcallReplyMessage reply;
+    demux_server(request, reply);
+    std::vector<uint8_t> unhandled;
+    const uint8_t* bytes = reply.bytes.data();
+    size_t size = reply.size;
+    if (size == 0) {
+        unhandled = BTHUpcallErrorReply(buffer, static_cast<size_t>(n), kBTHUpcallBadMessageId);
+        bytes = unhandled.data();
+        size = unhandled.size();
+    }
+    if (int error = BTHUpcallSend(fd, bytes, size, reply.data ? reply.data.get() : -1))
+        BTHLogError("Failed to send the upcall reply: %s", strerror(error));
 }
 
 void BTHUpcallServer::close(int fd) {

@@ -1,10 +1,10 @@
 // The kernel upcall service: the sandbox launcher asks, on the upcall socket,
 // for every directory of a process being started. Messages are received and
-// answered on the main queue.
-//
-// Until the process-containers routine is built into this daemon, every
-// request gets an error reply whose return code is 5 (the request cannot be
-// served); messages of another id get -303 (bad message id).
+// answered one at a time on the main queue. Each received message gets the
+// trailer the kernel interface would add (the sender's audit token, from the
+// credentials the kernel recorded when the sender connected) and goes to
+// demux_server; a message of an id no routine handles is answered with -303
+// (bad message id), so no sender waits for ever.
 #pragma once
 
 #include <cstdint>
@@ -13,18 +13,12 @@
 #include <optional>
 #include <vector>
 
+#include "core/UpcallWire.h"
 #include "platform/RunLoop.h"
 #include "platform/ServiceCheckIn.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
-
-inline constexpr uint32_t kBTHUpcallRequestId = 322514900;
-inline constexpr uint32_t kBTHUpcallReplyIdOffset = 100;
-inline constexpr size_t kBTHUpcallRequestSize = 52;
-inline constexpr size_t kBTHUpcallErrorReplySize = 36;
-inline constexpr int32_t kBTHUpcallBadMessageId = -303;
-inline constexpr int32_t kBTHUpcallCannotServe = 5;
 
 // The error reply to `request` (at least the 24-byte header): the request's
 // reply-port disposition without the complex bit, size 36, its remote port,

@@ -7,7 +7,6 @@
 #include <cstring>
 
 #include "BTHDaemon.h"
-#include "BTHUpcallServer.h"
 #include "DaemonSupport.h"
 #include "core/ErrorCodes.h"
 #include "platform/NamedSemaphore.h"
@@ -105,31 +104,6 @@ TEST_F(DaemonStartupTest, RequestsFromAnUnsignedCallerReachOnlyOpenCommands) {
     EXPECT_EQ(replyError(*connection_, Value::dictionary()), uint64_t{BTHErrorInvalidParameter});
     EXPECT_NE(logText().find("missing required entitlement: sys.kelp.private.Berth.allowed"),
               std::string::npos);
-}
-
-TEST_F(DaemonStartupTest, UpcallRequestsGetErrorReplies) {
-    ASSERT_NO_FATAL_FAILURE(start());
-    const UniqueFd upcall =
-        test::connectUnix(root() / "run/berthd/sys.kelp.berthd.upcall", SOCK_SEQPACKET);
-    ASSERT_TRUE(upcall) << strerror(errno);
-    const int fd = upcall.get();
-
-    for (uint32_t id : {kBTHUpcallRequestId, kBTHUpcallRequestId + 1}) {
-        uint32_t message[13] = {};
-        message[0] = 0x80000000u | 0x12;  // complex, reply-port disposition 0x12
-        message[1] = 52;
-        message[2] = 0x1234;  // reply port
-        message[5] = id;
-        ASSERT_EQ(::send(fd, message, sizeof message, 0), 52);
-        uint32_t reply[16] = {};
-        ASSERT_EQ(::recv(fd, reply, sizeof reply, 0), 36);
-        EXPECT_EQ(reply[0], 0x12u);
-        EXPECT_EQ(reply[1], 36u);
-        EXPECT_EQ(reply[2], 0x1234u);
-        EXPECT_EQ(reply[5], id + 100);
-        EXPECT_EQ(static_cast<int32_t>(reply[8]),
-                  id == kBTHUpcallRequestId ? kBTHUpcallCannotServe : kBTHUpcallBadMessageId);
-    }
 }
 
 }  // namespace

@@ -59,6 +59,10 @@ std::vector<std::string> listing(const fs::path& directory) {
     return names;
 }
 
+std::string daemonLog() {
+    return readFile(deviceRoot() / "private/var/root/Library/Logs/Berth/berthd.log");
+}
+
 bool deathRowEmpties() {
     for (int i = 0; i < 250; ++i) {
         if (listing(deviceRoot() / kDeathRowDirectory).empty()) return true;

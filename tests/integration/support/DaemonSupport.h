@@ -45,6 +45,8 @@ std::string text(const Value& reply, const char* key);
 
 // Names in a directory, sorted; none when it does not exist.
 std::vector<std::string> listing(const std::filesystem::path& directory);
+// The daemon's rotating log on the scratch root, as written so far.
+std::string daemonLog();
 // Waits (bounded) for the background emptying of death row.
 bool deathRowEmpties();
 
