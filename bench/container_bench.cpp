@@ -47,6 +47,7 @@
 #include "BTHGlobalConfiguration.h"
 #include "BTHMetadata.h"
 #include "BenchDaemon.h"
+#include "BenchLatency.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
@@ -169,68 +170,17 @@ Rebuild timeRebuild(const std::filesystem::path& binary, const std::filesystem::
     return result;
 }
 
-struct Throughput {
-    double requestsPerSecond = 0;
-    double p50Microseconds = 0;
-    double p99Microseconds = 0;
-    uint64_t failures = 0;
-};
-
-// Runs `clients` threads, each sending makeRequest(client, n) for n = 0, 1,
-// ... on its own connection; measures after a short warm-up.
-Throughput measure(const std::filesystem::path& socket, int clients, double seconds,
-                   const std::function<Value(int client, uint64_t n)>& makeRequest) {
-    std::atomic<bool> measuring{false}, stop{false}, broken{false};
-    std::atomic<uint64_t> failures{0};
-    std::vector<std::vector<double>> latencies(clients);
-    std::vector<std::thread> threads;
-    for (int c = 0; c < clients; ++c) {
-        threads.emplace_back([&, c] {
-            BenchClient client(socket);
-            std::vector<double>& mine = latencies[c];
-            for (uint64_t n = 0; !stop.load(std::memory_order_relaxed); ++n) {
-                const Value request = makeRequest(c, n);
-                const auto start = Clock::now();
-                const uint64_t code = client.connected() ? client.call(request) : 0;
-                if (code == 0) {
-                    broken = true;
-                    return;
-                }
-                if (!measuring.load(std::memory_order_relaxed)) continue;
-                if (code != 1) failures.fetch_add(1, std::memory_order_relaxed);
-                mine.push_back(
-                    std::chrono::duration<double, std::micro>(Clock::now() - start).count());
-            }
-        });
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(300));  // warm-up
-    measuring = true;
-    const auto begin = Clock::now();
-    std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
-    measuring = false;
-    const double elapsed = std::chrono::duration<double>(Clock::now() - begin).count();
-    stop = true;
-    for (std::thread& thread : threads) thread.join();
-    if (broken) die("a connection to berthd broke or got no reply in time");
-
-    std::vector<double> all;
-    for (const std::vector<double>& mine : latencies)
-        all.insert(all.end(), mine.begin(), mine.end());
-    Throughput result;
-    result.failures = failures;
-    if (all.empty()) return result;
-    std::sort(all.begin(), all.end());
-    result.requestsPerSecond = static_cast<double>(all.size()) / elapsed;
-    result.p50Microseconds = all[all.size() / 2];
-    result.p99Microseconds = all[std::min(all.size() - 1, all.size() * 99 / 100)];
-    return result;
-}
-
-void printRow(const char* workload, int clients, const Throughput& result) {
-    std::printf("%-8s %7d %12.0f %10.1f %10.1f", workload, clients, result.requestsPerSecond,
-                result.p50Microseconds, result.p99Microseconds);
-    if (result.failures) std::printf("   (%llu failed)", (unsigned long long)result.failures);
-    std::printf("\n");
+// Round trips of makeRequest(client, n) on one connection per client.
+bench::Latency measure(const std::filesystem::path& socket, int clients, double seconds,
+                       const std::function<Value(int client, uint64_t n)>& makeRequest) {
+    return bench::measureRoundTrips(clients, seconds, [&](int c) -> bench::RoundTripFunction {
+        auto client = std::make_shared<BenchClient>(socket);
+        return [client, c, &makeRequest](uint64_t n) {
+            const uint64_t code = client->connected() ? client->call(makeRequest(c, n)) : 0;
+            if (code == 0) return bench::RoundTrip::kBroken;
+            return code == 1 ? bench::RoundTrip::kSucceeded : bench::RoundTrip::kFailed;
+        };
+    });
 }
 
 struct Settings {
@@ -262,11 +212,10 @@ void run(const Settings& settings, const std::filesystem::path& root) {
                 median.firstMilliseconds / median.nextMilliseconds);
 
     BenchDaemon daemon(settings.berthd, root);
-    std::printf("%-8s %7s %12s %10s %10s\n", "workload", "clients", "requests/s", "p50 us",
-                "p99 us");
+    bench::printLatencyHeader();
     for (int clients : {1, 8}) {
         // Fresh identifiers in every row: "<clients>.<client>.<n>".
-        printRow(
+        bench::printLatencyRow(
             "create", clients,
             measure(daemon.socket(), clients, settings.seconds, [clients](int client, uint64_t n) {
                 return lookupRequest(kDataApplication,
@@ -277,7 +226,7 @@ void run(const Settings& settings, const std::filesystem::path& root) {
     }
     const uint64_t count = settings.count;
     for (int clients : {1, 8}) {
-        printRow(
+        bench::printLatencyRow(
             "lookup", clients,
             measure(daemon.socket(), clients, settings.seconds, [count](int client, uint64_t n) {
                 // Each client walks the containers from its own start.
