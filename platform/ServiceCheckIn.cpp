@@ -12,6 +12,7 @@
 
 #include "platform/DeviceRoot.h"
 #include "platform/SafeFs.h"
+#include "platform/ServiceManager.h"
 
 namespace berth {
 namespace {
@@ -81,6 +82,29 @@ std::filesystem::path ServiceCheckIn::runtimeDirectory() {
     return DeviceRoot::resolve("/run/berthd");
 }
 
+namespace {
+
+// A socket the service manager passed must be what the endpoint is: a
+// listening Unix socket of the endpoint's type. It is made non-blocking and
+// close-on-exec like one the daemon binds itself. 0 or an errno.
+int checkPassedSocket(int fd, int socketType) {
+    int domain = 0, type = 0, listening = 0;
+    socklen_t length = sizeof domain;
+    if (::getsockopt(fd, SOL_SOCKET, SO_DOMAIN, &domain, &length) != 0) return errno;
+    length = sizeof type;
+    if (::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &length) != 0) return errno;
+    length = sizeof listening;
+    if (::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &length) != 0) return errno;
+    if (domain != AF_UNIX || type != socketType || !listening) return EPROTOTYPE;
+    const int flags = ::fcntl(fd, F_GETFL);
+    if (flags < 0 || ::fcntl(fd, F_SETFL, flags | O_NONBLOCK) != 0 ||
+        ::fcntl(fd, F_SETFD, FD_CLOEXEC) != 0)
+        return errno;
+    return 0;
+}
+
+}  // namespace
+
 std::optional<ServiceCheckIn> ServiceCheckIn::claim(const std::string& name, int socketType,
                                                     mode_t mode, int* error, std::string* why,
                                                     const std::filesystem::path& directory) {
@@ -100,6 +124,12 @@ std::optional<ServiceCheckIn> ServiceCheckIn::claim(const std::string& name, int
     UniqueFd lock = lockEndpoint(dirFd.get(), name, &code, &reason);
     if (!lock) return fail(code, reason, error, why);
 
+    if (UniqueFd passed = ServiceManager::takeActivatedSocket(name)) {
+        if ((code = checkPassedSocket(passed.get(), socketType)) != 0)
+            return fail(code, describeErrno("the passed socket " + name + " is unusable", code),
+                        error, why);
+        return ServiceCheckIn(std::move(lock), std::move(passed), dir / name);
+    }
     if ((code = removeStaleEndpoint(dirFd.get(), name)) != 0)
         return fail(code, describeErrno("cannot remove the stale endpoint " + name, code), error,
                     why);

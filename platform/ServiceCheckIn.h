@@ -11,6 +11,10 @@
 //   - a socket file left behind by a killed instance is stale by definition
 //     once its lock is free, and is unlinked and bound afresh.
 //
+// When the service manager passed a listening socket named after the
+// endpoint (socket activation), the claim takes that socket instead of
+// binding one; the lock is taken all the same.
+//
 // The runtime directory is created (mode 0755) when missing; no component of
 // its path below the device root may be a symbolic link, and the socket is
 // created and chmod'ed relative to the directory descriptor, so nobody can

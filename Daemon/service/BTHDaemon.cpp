@@ -2,8 +2,11 @@
 
 #include "BTHFaultInjection.h"
 
+#include <signal.h>
+#include <sys/signalfd.h>
 #include <sys/socket.h>
 #include <syslog.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
@@ -27,6 +30,8 @@
 #include "platform/RelayTransaction.h"
 #include "platform/RunLoop.h"
 #include "platform/ServiceCheckIn.h"
+#include "platform/ServiceManager.h"
+#include "platform/UniqueFd.h"
 
 namespace berth {
 
@@ -49,6 +54,9 @@ void openRotatingLog() {
     const uint64_t limit = internal ? kInternalLogSizeLimit : kLogSizeLimit;
     gLogFileCount = count;
     auto handle = std::make_shared<BTHLogHandle>(kBTHServiceName, BTHLogLevelNotice);
+    // Under the service manager the journal gets every line too; the
+    // rotating file stays the record the device keeps.
+    if (ServiceManager::loggingToJournal()) handle->enableJournalLogging();
     if (handle->enableDiskLogging(logPath, count, limit)) {
         BTHLogSetHandle(handle);
     } else {
@@ -82,6 +90,26 @@ void registerForLockStateChanges(RunLoop& runLoop) {
     callback.run();
 }
 
+// An orderly stop by the system: the service manager learns the daemon is
+// ending, then the process ends at once. Nothing is lost: every log line is
+// already on disk, and the stored state survives a stop at any point, as it
+// survives SIGKILL.
+void watchForTermination(RunLoop& runLoop) {
+    BTH_FUNCTION("main");
+    sigset_t signals;
+    sigemptyset(&signals);
+    sigaddset(&signals, SIGTERM);
+    static UniqueFd terminations(::signalfd(-1, &signals, SFD_NONBLOCK | SFD_CLOEXEC));
+    if (!terminations) {
+        BTHLogError("Failed to watch for termination: %s", strerror(errno));
+        return;
+    }
+    runLoop.watchReadable(terminations.get(), [] {
+        ServiceManager::notifyStopping();
+        ::_exit(0);
+    });
+}
+
 // Step 16: the request listener on the concurrent listener queue.
 std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& listenerQueue) {
     BTH_FUNCTION("main");
@@ -91,6 +119,7 @@ std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& l
         ServiceCheckIn::claim(kBTHServiceName, SOCK_STREAM, 0666, &error, &why);
     if (!checkIn) {
         BTHLogError("unable to start relay service!");
+        ServiceManager::notifyStatus("No request socket: " + why);
         return nullptr;
     }
     // The claim (its lock) must outlive the listener: keep it for the process.
@@ -108,6 +137,7 @@ std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& l
         RelayListener::make(claim->takeSocket(), listenerQueue, std::move(options), &why);
     if (!listener) {
         BTHLogError("unable to start relay service!");
+        ServiceManager::notifyStatus("No request socket: " + why);
         return nullptr;
     }
     listener->setEventHandler([](const std::shared_ptr<RelayConnection>& connection) {
@@ -126,6 +156,12 @@ uint32_t BTHLogFileCount() {
 
 int BTHDaemonMain() {
     BTH_FUNCTION("main");
+    // Every thread made from here on inherits the blocked SIGTERM, so the
+    // main thread's run loop alone receives it.
+    sigset_t termination;
+    sigemptyset(&termination);
+    sigaddset(&termination, SIGTERM);
+    ::pthread_sigmask(SIG_BLOCK, &termination, nullptr);
     RunLoop& runLoop = RunLoop::main();
     RelayTransaction::begin();  // step 1: busy until start-up is done
     BTHFaultInjectionLoadFromEnvironment();
@@ -147,6 +183,7 @@ int BTHDaemonMain() {
     }
     const std::shared_ptr<BTHClientConnection>& daemonClient =
         BTHClientConnection::sharedClientConnection();
+    ServiceManager::notifyStatus("Recovering interrupted replaces");
     daemonClient->berthSetup();
 
     std::unique_ptr<BTHUpcallServer> upcall = BTHUpcallServer::start(runLoop);
@@ -160,12 +197,20 @@ int BTHDaemonMain() {
         BTHLogNotice("berthd first boot cleanup complete");
         setFirstBootWorkCompleted();
     }
+    ServiceManager::notifyStatus("Cleaning up staging and death row");
     daemonClient->berthCleanup();
     RelayTransaction::end();
 
     const std::shared_ptr<WorkQueue> listenerQueue =
         WorkQueue::makeConcurrent("sys.kelp.berthd.listener");
     std::unique_ptr<RelayListener> listener = startListener(listenerQueue);
+    watchForTermination(runLoop);
+    // Without its request socket the daemon still serves the upcall, but it
+    // is not ready: the service manager's start-up time limit then decides.
+    if (listener) {
+        ServiceManager::notifyStatus("Serving requests");
+        ServiceManager::notifyReady();
+    }
     runLoop.run();
     return 0;
 }

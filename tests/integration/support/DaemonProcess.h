@@ -9,14 +9,28 @@
 #include <map>
 #include <optional>
 #include <string>
+#include <utility>
+#include <vector>
 
 namespace berth::test {
+
+// How a daemon is started beyond its device root.
+struct DaemonLaunch {
+    std::map<std::string, std::string> environment;
+    // Listening sockets handed over as the service manager does: from
+    // descriptor 3 on, with LISTEN_PID, LISTEN_FDS and LISTEN_FDNAMES.
+    std::vector<std::pair<std::string, int>> passedSockets;
+    // A program that starts the daemon for us; the daemon's path is
+    // appended to these arguments.
+    std::vector<std::string> launcher;
+};
 
 class DaemonProcess {
   public:
     // Starts the daemon binary on `root` with extra environment variables;
     // its standard error goes to <root>/berthd.stderr.
     DaemonProcess(std::filesystem::path root, std::map<std::string, std::string> environment = {});
+    DaemonProcess(std::filesystem::path root, DaemonLaunch launch);
     ~DaemonProcess();  // kills it if still running
     DaemonProcess(const DaemonProcess&) = delete;
     DaemonProcess& operator=(const DaemonProcess&) = delete;
