@@ -57,7 +57,7 @@ BTHErrorRef BTHCreateErrorv(const char* function, int line, std::string_view dom
         if (logFlag == 1 && BTHLogEnabled(BTHLogLevelError)) {
             std::string message = underlying ? format("%d: %@ (%@)", line, description, underlying)
                                              : format("%d: %@", line, description);
-            BTHLogWrite(BTHLogLevelError, function ? function : "", message);
+            BTHLogWriteWithCode(BTHLogLevelError, function ? function : "", message, code);
         }
         userInfo.set(kBTHLocalizedDescriptionKey, std::move(description));
     }

@@ -5,6 +5,7 @@
 #include <atomic>
 #include <cstdio>
 
+#include "platform/JournalLog.h"
 #include "platform/RotatingLogSink.h"
 
 namespace berth {
@@ -14,6 +15,34 @@ namespace {
 std::atomic<std::shared_ptr<BTHLogHandle>>& handleSlot() {
     static std::atomic<std::shared_ptr<BTHLogHandle>> slot;
     return slot;
+}
+
+std::string composeLine(int level, std::string_view function, std::string_view message);
+
+thread_local const BTHLogIdentifierScope* tCurrentScope = nullptr;
+
+void sendToJournal(int level, std::string_view function, std::string_view message,
+                   std::optional<int64_t> code) {
+    JournalField fields[3];
+    size_t count = 0;
+    fields[count++] = {"CODE_FUNC", function};
+    const std::string codeText = code ? std::to_string(*code) : std::string();
+    if (code) fields[count++] = {"BERTH_CODE", codeText};
+    if (const std::string* identifier = BTHLogIdentifierScope::current())
+        fields[count++] = {"BERTH_IDENTIFIER", *identifier};
+    JournalSend(level, message, std::span<const JournalField>(fields, count));
+}
+
+void writeLine(int level, std::string_view function, std::string_view message,
+               std::optional<int64_t> code) {
+    if (std::shared_ptr<BTHLogHandle> handle = BTHLogGetHandle()) {
+        handle->write(level, function, message);
+        if (handle->journalLogging()) sendToJournal(level, function, message, code);
+        return;
+    }
+    std::string line = composeLine(level, function, message);
+    line.push_back('\n');
+    fwrite(line.data(), 1, line.size(), stderr);
 }
 
 constexpr const char* kLinePattern = "%Y-%m-%d %H:%M:%S.%e %t %v";
@@ -87,13 +116,25 @@ bool BTHLogEnabled(int level) {
 }
 
 void BTHLogWrite(int level, std::string_view function, std::string_view message) {
-    if (std::shared_ptr<BTHLogHandle> handle = BTHLogGetHandle()) {
-        handle->write(level, function, message);
-        return;
-    }
-    std::string line = composeLine(level, function, message);
-    line.push_back('\n');
-    fwrite(line.data(), 1, line.size(), stderr);
+    writeLine(level, function, message, std::nullopt);
+}
+
+void BTHLogWriteWithCode(int level, std::string_view function, std::string_view message,
+                         int64_t code) {
+    writeLine(level, function, message, code);
+}
+
+BTHLogIdentifierScope::BTHLogIdentifierScope(std::string identifier)
+    : identifier_(std::move(identifier)), outer_(tCurrentScope) {
+    tCurrentScope = this;
+}
+
+BTHLogIdentifierScope::~BTHLogIdentifierScope() {
+    tCurrentScope = outer_;
+}
+
+const std::string* BTHLogIdentifierScope::current() {
+    return tCurrentScope ? &tCurrentScope->identifier_ : nullptr;
 }
 
 }  // namespace berth

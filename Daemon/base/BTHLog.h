@@ -14,6 +14,11 @@
 //     BTHLogNotice("Unset UF_IMMUTABLE on %s", path.c_str());
 //
 // The macros evaluate their arguments only when the line will be written.
+//
+// Under the service manager the lines also go to the journal, each with its
+// level as priority and, where known, the error code it reports
+// ("BERTH_CODE") and the identifier of the request being served
+// ("BERTH_IDENTIFIER"); the scopes below say which.
 #pragma once
 
 #include <spdlog/logger.h>
@@ -21,6 +26,7 @@
 #include <cstdint>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -46,6 +52,10 @@ class BTHLogHandle {
     bool enableDiskLogging(const std::filesystem::path& path, uint32_t rotatedFiles,
                            uint64_t sizeLimit);
 
+    // Also sends every line to the journal, with its structured fields.
+    void enableJournalLogging() { journal_ = true; }
+    bool journalLogging() const { return journal_; }
+
     // Adds another destination (tests use this to see what was written).
     void addSink(spdlog::sink_ptr sink);
 
@@ -56,8 +66,30 @@ class BTHLogHandle {
 
   private:
     int threshold_;
+    bool journal_ = false;
     std::shared_ptr<spdlog::logger> logger_;
 };
+
+// While one lives, the lines its thread writes carry `identifier` as the
+// identifier being served. Scopes nest; the innermost wins.
+class BTHLogIdentifierScope {
+  public:
+    explicit BTHLogIdentifierScope(std::string identifier);
+    ~BTHLogIdentifierScope();
+    BTHLogIdentifierScope(const BTHLogIdentifierScope&) = delete;
+    BTHLogIdentifierScope& operator=(const BTHLogIdentifierScope&) = delete;
+
+    // The identifier of the innermost scope of this thread, if any.
+    static const std::string* current();
+
+  private:
+    std::string identifier_;
+    const BTHLogIdentifierScope* outer_;
+};
+
+// Writes one line that reports the error `code` (the error objects use it).
+void BTHLogWriteWithCode(int level, std::string_view function, std::string_view message,
+                         int64_t code);
 
 // The daemon's log handle; null until start-up opens it or when it could not
 // be opened. Start-up sets it once before any other thread runs.

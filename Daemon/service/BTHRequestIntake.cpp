@@ -25,6 +25,14 @@ std::shared_ptr<BTHClientConnection> refuse(const BTHPeerIdentity& peer,
     return nullptr;
 }
 
+// The identifier a request concerns, for the log: the one it names, else
+// the caller's own.
+std::string servedIdentifier(const Value& message, const BTHPeerIdentity& peer) {
+    if (const Value* named = message.find("Identifier"); named && named->string())
+        return *named->string();
+    return peer.signingIdentifier.value_or("");
+}
+
 }  // namespace
 
 std::shared_ptr<BTHClientConnection> checkEntitlementsAndInitClientObject(
@@ -113,6 +121,7 @@ void BTHProcessRequest(const BTHRequestRef& request) {
     bool repliesAtOnce = true;
 
     const BTHPeerIdentity& peer = request->peer();
+    const BTHLogIdentifierScope logScope(servedIdentifier(request->message(), peer));
     if (command >= kBTHCommandCount) {
         BTHLogError("Invalid command index: %lld", command);
         replyError = BTHErrorInvalidCommand;
