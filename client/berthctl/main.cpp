@@ -8,9 +8,11 @@
 #include <iostream>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "CommandsListing.h"
+#include "Completion.h"
 #include "ContainerCommands.h"
 #include "ExitStatus.h"
 #include "LockCommand.h"
@@ -252,6 +254,10 @@ int main(int argc, char** argv) {
     for (const auto& removal : removals)
         containerCommands.push_back(
             addContainerCommand(app, removal.name, removal.description, removal.action, args));
+
+    // Asked by the shells' completion scripts; never shown in the help.
+    if (argc >= 2 && std::string_view(argv[1]) == "__complete")
+        return printCompletions(app, std::vector<std::string>(argv + 2, argv + argc), std::cout);
 
     try {
         app.parse(argc, argv);
