@@ -25,6 +25,7 @@
 
 #include "BTHError.h"
 #include "platform/TreeWalk.h"
+#include "platform/UniqueFd.h"
 
 namespace berth {
 
@@ -117,6 +118,55 @@ class BTHFileManager {
     // determined both answer false and log why.
     bool itemExistsAtURL(const std::filesystem::path& url);
     bool itemDoesNotExistAtURL(const std::filesystem::path& url);
+
+    // Contained paths (BTHFileManager+ContainedPath.cpp). A client may name
+    // an item inside one of its containers by a path of its choosing; before
+    // the daemon acts on it, the path must be proven to stay inside the
+    // container once every link in it is resolved. A leading "/private" is
+    // transparent (it is where "/var" really lives). Every refusal is a null
+    // result with one error-level line; none makes an error object.
+
+    // The real path of `suspicious` when it lies at or below `base` (or is
+    // `base`), else null. Refused: either path missing, a path that is not
+    // textually below the base, a ".." component, an absolute link, a link
+    // whose text climbs above the directory it is in more than the base
+    // allows, and any real path (of a link too) whose components leave the
+    // base's. A suspicious path that does not exist yet is resolved through
+    // its longest existing prefix; the base must exist.
+    std::optional<std::filesystem::path> realPathForURL(
+        const std::optional<std::filesystem::path>& suspicious,
+        const std::optional<std::filesystem::path>& base);
+
+    // The item at `suspicious`, proven inside `base` as above, opened for the
+    // caller to act on without resolving a path again: the descriptor of its
+    // parent directory (O_PATH), reached beneath the base's descriptor with
+    // no link followed, and its name there. A link swapped into the path
+    // after the check makes the open fail instead of leading elsewhere.
+    // Null on failure with errno set: EXDEV when the item is not contained
+    // (logged as above), else the error of the open that failed.
+    struct ContainedItem {
+        UniqueFd parent;
+        std::string name;
+        std::filesystem::path realPath;
+    };
+    std::optional<ContainedItem> openContainedItem(const std::filesystem::path& suspicious,
+                                                   const std::filesystem::path& base);
+
+    // The real path of `url` (realpath(3)); when `allowNonExistentPathComponents`
+    // and a component is missing, that of its longest existing prefix with
+    // the rest appended. Null on failure, logged ("Failed to realpath %s : %s
+    // at %s").
+    std::optional<std::filesystem::path> _realPathForURL(const std::filesystem::path& url,
+                                                         bool allowNonExistentPathComponents);
+    // The real path of the longest existing proper prefix of `path` (the
+    // whole path first, the root alone never) with the missing components
+    // appended; null when no prefix exists and resolves.
+    std::optional<std::filesystem::path> _realPathWhatExistsInPath(const std::string& path);
+    // Whether the depth of `path` (".." -1, a name +1, "", "." and "/" 0),
+    // starting at `startingDepth`, never falls below it; the final depth in
+    // `endingDepth`. False for a null path.
+    static bool _validateSymlink(const std::string* path, int32_t startingDepth,
+                                 int32_t* endingDepth);
 
     // Access control lists and ownership (BTHFileManager+ACL.cpp). System
     // containers are shared by system processes of different users through

@@ -1,0 +1,121 @@
+// A directory tree and a path, both chosen by the input, checked for
+// containment in the tree's "base" directory. Whatever the tree holds (links
+// climbing out, links to links, links to the base, magic links) and whatever
+// the path says, the answer is a refusal or a real path inside the base, and
+// an item opened through it lies inside the base.
+//
+// Input: the first line is the path below the base; every further line
+// makes one item of the tree, relative to its top (which holds "base" and
+// "outside"): "d NAME" a directory, "f NAME" a file, "l NAME TEXT" a link.
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+
+#include "BTHFileManager.h"
+#include "BTHLog.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr size_t kMaxItems = 24;
+
+class ScratchTree {
+  public:
+    ScratchTree() {
+        std::string templ = (fs::temp_directory_path() / "berth-fuzz-contained.XXXXXX").string();
+        if (!mkdtemp(templ.data())) std::abort();
+        top_ = fs::canonical(templ);
+    }
+    ~ScratchTree() {
+        std::error_code ignored;
+        fs::remove_all(top_, ignored);
+    }
+
+    // A fresh tree: empty "base" and "outside" with a secret.
+    void reset() {
+        std::error_code ignored;
+        fs::remove_all(top_ / "base", ignored);
+        fs::remove_all(top_ / "outside", ignored);
+        fs::create_directories(top_ / "base");
+        fs::create_directories(top_ / "outside");
+        std::ofstream(top_ / "outside/secret") << "secret";
+    }
+
+    // Makes one item; names that climb or are absolute are skipped, so the
+    // tree itself never reaches beyond its top.
+    void make(char kind, const std::string& name, const std::string& text) {
+        const fs::path relative(name);
+        if (name.empty() || relative.is_absolute()) return;
+        for (const auto& part : relative)
+            if (part == "..") return;
+        const fs::path item = top_ / relative;
+        std::error_code ignored;
+        fs::create_directories(item.parent_path(), ignored);
+        if (kind == 'd') fs::create_directories(item, ignored);
+        if (kind == 'f') std::ofstream(item) << "item";
+        if (kind == 'l') fs::create_symlink(text, item, ignored);
+    }
+
+    const fs::path& top() const { return top_; }
+    fs::path base() const { return top_ / "base"; }
+
+  private:
+    fs::path top_;
+};
+
+bool inside(const std::string& path, const std::string& base) {
+    return path == base || path.rfind(base + "/", 0) == 0;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    static ScratchTree tree;
+    static const bool quiet = [] {
+        berth::BTHLogSetHandle(std::make_shared<berth::BTHLogHandle>("fuzz", 0));
+        return true;
+    }();
+    (void)quiet;
+    tree.reset();
+
+    std::istringstream input(std::string(reinterpret_cast<const char*>(data), size));
+    std::string suspicious;
+    std::getline(input, suspicious);
+    std::string line;
+    for (size_t items = 0; items < kMaxItems && std::getline(input, line); ++items) {
+        if (line.size() < 3 || line[1] != ' ') continue;
+        const std::string rest = line.substr(2);
+        const size_t space = rest.find(' ');
+        tree.make(line[0], rest.substr(0, space),
+                  space == std::string::npos ? std::string() : rest.substr(space + 1));
+    }
+
+    const std::string base = tree.base().string();
+    berth::BTHFileManager& manager = berth::BTHFileManager::defaultManager();
+    const std::string path = base + "/" + suspicious;
+    if (auto real = manager.realPathForURL(fs::path(path), tree.base())) {
+        if (!inside(real->string(), base)) __builtin_trap();
+        // An existing item it names is really inside. (A dangling link may
+        // be named itself; it is never followed, as the open below shows.)
+        std::error_code error;
+        if (fs::exists(*real, error) && !fs::is_symlink(*real, error)) {
+            const fs::path resolved = fs::canonical(*real, error);
+            if (!error && !inside(resolved.string(), base)) __builtin_trap();
+        }
+    }
+    if (auto item = manager.openContainedItem(fs::path(path), tree.base())) {
+        char where[4096] = {};
+        const std::string link = "/proc/self/fd/" + std::to_string(item->parent.get());
+        const ssize_t n = ::readlink(link.c_str(), where, sizeof where - 1);
+        if (n <= 0 || !inside(std::string(where, n), base)) __builtin_trap();
+    }
+    return 0;
+}
