@@ -33,8 +33,34 @@ void sendToJournal(int level, std::string_view function, std::string_view messag
     JournalSend(level, message, std::span<const JournalField>(fields, count));
 }
 
-void writeLine(int level, std::string_view function, std::string_view message,
+// The length of the well-formed UTF-8 sequence at `at` (0 when there is
+// none) and its code point.
+size_t utf8Sequence(std::string_view text, size_t at, uint32_t* codePoint) {
+    const auto byte = [&](size_t i) { return static_cast<unsigned char>(text[i]); };
+    const unsigned char lead = byte(at);
+    size_t length = lead >= 0xF0 && lead <= 0xF4 ? 4 : lead >= 0xE0 ? 3 : lead >= 0xC2 ? 2 : 0;
+    if (lead >= 0xF5 || length == 0 || at + length > text.size()) return 0;
+    uint32_t value = lead & (0x7F >> length);
+    for (size_t i = 1; i < length; ++i) {
+        if ((byte(at + i) & 0xC0) != 0x80) return 0;
+        value = value << 6 | (byte(at + i) & 0x3F);
+    }
+    const uint32_t smallest[] = {0, 0, 0x80, 0x800, 0x10000};
+    if (value < smallest[length] || value > 0x10FFFF || (value >= 0xD800 && value <= 0xDFFF))
+        return 0;
+    *codePoint = value;
+    return length;
+}
+
+void appendEscapedCodePoint(std::string& out, uint32_t codePoint) {
+    char buffer[12];
+    std::snprintf(buffer, sizeof buffer, "\\u%04X", codePoint);
+    out += buffer;
+}
+
+void writeLine(int level, std::string_view function, std::string_view rawMessage,
                std::optional<int64_t> code) {
+    const std::string message = BTHLogEscape(rawMessage);
     if (std::shared_ptr<BTHLogHandle> handle = BTHLogGetHandle()) {
         handle->write(level, function, message);
         if (handle->journalLogging()) sendToJournal(level, function, message, code);
@@ -122,6 +148,50 @@ void BTHLogWrite(int level, std::string_view function, std::string_view message)
 void BTHLogWriteWithCode(int level, std::string_view function, std::string_view message,
                          int64_t code) {
     writeLine(level, function, message, code);
+}
+
+std::string BTHLogEscape(std::string_view text) {
+    // One trailing newline ends the line the writer meant; it is not text.
+    if (!text.empty() && text.back() == '\n') text.remove_suffix(1);
+    std::string out;
+    out.reserve(text.size());
+    for (size_t i = 0; i < text.size();) {
+        const unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c >= 0x20 && c < 0x7F) {
+            out.push_back(static_cast<char>(c));
+            ++i;
+            continue;
+        }
+        uint32_t codePoint = 0;
+        const size_t length = c >= 0x80 ? utf8Sequence(text, i, &codePoint) : 0;
+        if (length > 0) {
+            // C1 controls and the line and paragraph separators break lines
+            // on some terminals and readers; other characters are kept.
+            if (codePoint <= 0x9F || codePoint == 0x2028 || codePoint == 0x2029)
+                appendEscapedCodePoint(out, codePoint);
+            else
+                out.append(text.substr(i, length));
+            i += length;
+            continue;
+        }
+        char buffer[8];
+        switch (c) {
+            case '\n':
+                out += "\\n";
+                break;
+            case '\r':
+                out += "\\r";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            default:
+                std::snprintf(buffer, sizeof buffer, "\\x%02X", c);
+                out += buffer;
+        }
+        ++i;
+    }
+    return out;
 }
 
 BTHLogIdentifierScope::BTHLogIdentifierScope(std::string identifier)

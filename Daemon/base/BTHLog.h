@@ -87,6 +87,14 @@ class BTHLogIdentifierScope {
     const BTHLogIdentifierScope* outer_;
 };
 
+// `text` made safe to be one line of a log: control characters (C0, DEL,
+// C1), the line and paragraph separators and bytes that are not UTF-8 are
+// written as escapes ("\n", "\r", "\t", "\x1B", "\u0085", "\u2028"); one
+// trailing newline is dropped. Every line written goes through it, so a
+// client's identifier or a name read from disk can never start a line of
+// its own.
+std::string BTHLogEscape(std::string_view text);
+
 // Writes one line that reports the error `code` (the error objects use it).
 void BTHLogWriteWithCode(int level, std::string_view function, std::string_view message,
                          int64_t code);

@@ -84,5 +84,34 @@ TEST(BTHLogTest, UnopenableLogFileIsReported) {
     EXPECT_FALSE(handle.enableDiskLogging(dir / "missing" / "berthd.log", 1, 1024));
 }
 
+// Text from clients and disk becomes exactly one line, whatever it holds.
+TEST(BTHLogTest, EveryLineBreakerIsEscapedAndOtherTextKept) {
+    const std::pair<std::string, std::string> cases[] = {
+        {"com.example.app", "com.example.app"},
+        {"a\nb", "a\\nb"},
+        {"fake\r<error> main: forged", "fake\\r<error> main: forged"},
+        {"\x1b[2K\rforged", "\\x1B[2K\\rforged"},
+        {std::string("nul\0byte", 8), "nul\\x00byte"},
+        {"tab\tdel\x7f", "tab\\tdel\\x7F"},
+        {"next\xc2\x85line", "next\\u0085line"},  // C1 NEL
+        {"csi\xc2\x9b"
+         "2J",
+         "csi\\u009B2J"},  // C1 CSI
+        {"sep\xe2\x80\xa8par\xe2\x80\xa9", "sep\\u2028par\\u2029"},
+        {"lone\x9b byte", "lone\\x9B byte"},  // not UTF-8
+        {"overlong\xc0\x8a", "overlong\\xC0\\x8A"},
+        {"caf\xc3\xa9 \xe6\x97\xa5 \xf0\x9f\x93\xa6", "caf\xc3\xa9 \xe6\x97\xa5 \xf0\x9f\x93\xa6"},
+        {"truncated\xe2\x80", "truncated\\xE2\\x80"},
+        {"ends the line\n", "ends the line"},
+    };
+    for (const auto& [text, escaped] : cases) EXPECT_EQ(BTHLogEscape(text), escaped) << text;
+
+    test::LogCapture log;
+    BTH_FUNCTION("main");
+    BTHLogNotice("identifier %s", "x\r\x1b[1A\xe2\x80\xa8y");
+    ASSERT_EQ(log.lines().size(), 1u);
+    EXPECT_EQ(log.lines()[0].message, "identifier x\\r\\x1B[1A\\u2028y");
+}
+
 }  // namespace
 }  // namespace berth
