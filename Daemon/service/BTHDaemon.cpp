@@ -10,6 +10,7 @@
 #include <cstring>
 #include <optional>
 
+#include "BTHApplicationTerminationAssertion.h"
 #include "BTHAsyncWork.h"
 #include "BTHClientConnection.h"
 #include "BTHError.h"
@@ -154,6 +155,9 @@ int BTHDaemonMain() {
         BTHLogError("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
         return -1;
     }
+    // Holding the upcall endpoint makes this the device's one daemon: blocks
+    // left by a previous one died with its assertions.
+    BTHApplicationTerminationAssertion::clearStaleRelaunchBlocks();
     registerForLockStateChanges(runLoop);
 
     if (firstBoot) {
