@@ -172,6 +172,27 @@ TEST_F(BerthLaunchTest, TheProgramSeesOnlyItsContainersAsThePersona) {
     EXPECT_FALSE(fs::exists(cgroups_->pathOf("com.example.sandboxed")));
 }
 
+TEST_F(BerthLaunchTest, AContainerSwappedForALinkIsNeverBound) {
+    // Another process of the app's user swaps its group container for a link
+    // to another app's container. The daemon's look-up already refuses it
+    // (success 0); the launcher would too (it opens every path without
+    // following links). Either way nothing runs.
+    const upcall::Reply other = containersOf("com.example.victim");
+    const upcall::Reply own = containersOf("com.example.swapper", {"group.example.swapped"});
+    ASSERT_EQ(own.groups.size(), 1u);
+    const fs::path group = own.groups[0].second;
+    fs::rename(group, group.string() + ".aside");
+    fs::create_directory_symlink(*other.dataContainer, group);
+    const test::Outcome outcome =
+        Launch(launchArgs("com.example.swapper", "echo ran", {"--group", "group.example.swapped"}))
+            .wait();
+    EXPECT_EQ(outcome.status, 125);
+    EXPECT_EQ(outcome.out, "");
+    EXPECT_NE(outcome.err.find("berth-launch: "), std::string::npos) << outcome.err;
+    fs::remove(group);
+    fs::rename(group.string() + ".aside", group);
+}
+
 TEST_F(BerthLaunchTest, AnAssertionKillsTheProgramAndHoldsItUntilInvalidated) {
     const std::string identifier = "com.example.held";
     const fs::path started = fs::path(*containersOf(identifier).dataContainer) / "started";
