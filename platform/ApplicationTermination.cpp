@@ -88,10 +88,12 @@ void CgroupApplicationTermination::release(const std::string& identifier) {
 
 TerminationError CgroupApplicationTermination::terminate(const std::string& identifier) const {
     std::string why;
-    const std::optional<LaunchCgroup> cgroups = LaunchCgroup::locate(options_.cgroupParent, &why);
+    bool unmounted = false;
+    const std::optional<LaunchCgroup> cgroups =
+        LaunchCgroup::locate(options_.cgroupParent, &why, &unmounted);
     // Without a cgroup v2 hierarchy berth-launch starts nothing, so nothing
     // of the application can be running.
-    if (!cgroups) return {};
+    if (!cgroups) return unmounted ? TerminationError{} : TerminationError{EINVAL, why};
     const int code = cgroups->killAll(identifier, options_.killLimit, options_.useKillFile);
     if (code == 0) return {};
     if (code == ETIMEDOUT)

@@ -120,7 +120,9 @@ std::string LaunchCgroup::configuredParent() {
     return configured && *configured ? configured : kDefaultParent;
 }
 
-std::optional<LaunchCgroup> LaunchCgroup::locate(const std::string& parent, std::string* why) {
+std::optional<LaunchCgroup> LaunchCgroup::locate(const std::string& parent, std::string* why,
+                                                 bool* unmounted) {
+    if (unmounted) *unmounted = false;
     const std::filesystem::path relative(parent);
     bool valid = !parent.empty() && relative.is_relative();
     for (const auto& part : relative) valid = valid && part != "..";

@@ -33,9 +33,11 @@ class LaunchCgroup {
     static std::string configuredParent();
 
     // The launch cgroups of this system under `parent`. Nullopt, with the
-    // reason in `why`, when no cgroup v2 hierarchy is mounted or `parent`
-    // is not a relative path without "..". Creates nothing.
-    static std::optional<LaunchCgroup> locate(const std::string& parent, std::string* why);
+    // reason in `why`, when no cgroup v2 hierarchy is mounted (then
+    // `*unmounted` is set, when given) or `parent` is not a relative path
+    // without "..". Creates nothing.
+    static std::optional<LaunchCgroup> locate(const std::string& parent, std::string* why,
+                                              bool* unmounted = nullptr);
 
     // Whether `identifier` can name a group: a single directory name, not
     // hidden (no leading "."), and no interface file of the cgroup file

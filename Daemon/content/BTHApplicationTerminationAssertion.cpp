@@ -94,8 +94,8 @@ BTHApplicationTerminationAssertion::initWithBundleIdentifier(const std::string& 
         service->invalidate(assertion);
         return nullptr;
     }
-    return std::unique_ptr<BTHApplicationTerminationAssertion>(
-        new BTHApplicationTerminationAssertion(std::move(service), std::move(assertion)));
+    return std::make_unique<BTHApplicationTerminationAssertion>(Acquired{}, std::move(service),
+                                                                std::move(assertion));
 }
 
 BTHApplicationTerminationAssertion::~BTHApplicationTerminationAssertion() {

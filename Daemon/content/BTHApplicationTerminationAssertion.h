@@ -38,10 +38,18 @@ class BTHApplicationTerminationAssertion {
     static void clearStaleRelaunchBlocks();
 
   private:
-    BTHApplicationTerminationAssertion(std::shared_ptr<ApplicationTerminationService> service,
+    // Only initWithBundleIdentifier makes instances.
+    struct Acquired {
+        explicit Acquired() = default;
+    };
+
+  public:
+    BTHApplicationTerminationAssertion(Acquired,
+                                       std::shared_ptr<ApplicationTerminationService> service,
                                        std::shared_ptr<TerminationAssertionHandle> assertion)
         : service_(std::move(service)), _termAssertion(std::move(assertion)) {}
 
+  private:
     std::shared_ptr<ApplicationTerminationService> service_;
     // Present from a successful creation until invalidate().
     std::shared_ptr<TerminationAssertionHandle> _termAssertion;

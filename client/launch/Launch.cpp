@@ -67,9 +67,12 @@ std::optional<stdfs::path> findProgram(const std::string& name) {
     return std::nullopt;
 }
 
+// A program the sandbox's system directories already hold.
 bool isSystemProgram(const stdfs::path& program) {
     const std::string text = program.string();
-    return text.rfind("/usr/", 0) == 0 || text.rfind("/etc/", 0) == 0;
+    for (const char* top : {"/usr/", "/etc/", "/bin/", "/sbin/"})
+        if (text.rfind(top, 0) == 0) return true;
+    return false;
 }
 
 // Asks the daemon for the application's directories.

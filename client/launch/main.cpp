@@ -22,9 +22,13 @@ using namespace berth::launch;
 int asPersona(const std::vector<std::string>& args) {
     if (args.size() < 5 || args[3] != "--")
         return std::cerr << "berth-launch: malformed --as-persona\n", kExitUsage;
-    const uid_t uid = static_cast<uid_t>(std::stoul(args[1]));
-    const gid_t gid = static_cast<gid_t>(std::stoul(args[2]));
-    return runAsPersona(uid, gid, {args.begin() + 4, args.end()}, std::cerr);
+    try {
+        const uid_t uid = static_cast<uid_t>(std::stoul(args[1]));
+        const gid_t gid = static_cast<gid_t>(std::stoul(args[2]));
+        return runAsPersona(uid, gid, {args.begin() + 4, args.end()}, std::cerr);
+    } catch (const std::exception&) {
+        return std::cerr << "berth-launch: malformed --as-persona ids\n", kExitUsage;
+    }
 }
 
 }  // namespace

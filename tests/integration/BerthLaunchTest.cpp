@@ -13,6 +13,7 @@
 #include "BTHApplicationTerminationAssertion.h"
 #include "DaemonSupport.h"
 #include "platform/LaunchCgroup.h"
+#include "platform/RelaunchBlock.h"
 #include "upcall/BerthUpcall.h"
 
 namespace berth {
@@ -219,6 +220,21 @@ TEST_F(BerthLaunchTest, AnAssertionKillsTheProgramAndHoldsItUntilInvalidated) {
     const test::Outcome again = Launch(launchArgs(identifier, "echo ran")).wait();
     EXPECT_EQ(again.status, 0) << again.err;
     EXPECT_EQ(again.out, "ran\n");
+}
+
+TEST_F(BerthLaunchTest, ADaemonStartLiftsTheBlocksOfItsPredecessor) {
+    // A daemon that died holding an assertion left its block behind.
+    ASSERT_EQ(RelaunchBlocks().set("com.example.orphaned", "installation"), 0);
+    const test::Outcome refused = Launch({"--identifier", "com.example.orphaned", "--persona",
+                                          "501", "--", "/bin/echo", "ran"})
+                                      .wait();
+    EXPECT_EQ(refused.status, 125) << refused.err;
+    ASSERT_NO_FATAL_FAILURE(start({{"BERTH_LAUNCH_CGROUP", kCgroupParent}}));
+    const test::Outcome launched = Launch({"--identifier", "com.example.orphaned", "--persona",
+                                           "501", "--", "/bin/echo", "ran"})
+                                       .wait();
+    EXPECT_EQ(launched.status, 0) << launched.err;
+    EXPECT_EQ(launched.out, "ran\n");
 }
 
 TEST_F(BerthLaunchTest, ItsOwnStatusOrTheProgramsComesBack) {
