@@ -11,6 +11,7 @@
 #include <cstdlib>
 
 #include "BTHApplicationTerminationAssertion.h"
+#include "CgroupSupport.h"
 #include "DaemonSupport.h"
 #include "platform/LaunchCgroup.h"
 #include "platform/RelaunchBlock.h"
@@ -76,10 +77,21 @@ class BerthLaunchTest : public test::DaemonFixture {
     void SetUp() override {
         DaemonFixture::SetUp();
         if (HasFatalFailure() || IsSkipped()) return;
-        if (!findBubblewrap()) GTEST_SKIP() << "bubblewrap (bwrap) is not installed";
+        const std::optional<fs::path> bwrap = findBubblewrap();
+        if (!bwrap) GTEST_SKIP() << "bubblewrap (bwrap) is not installed";
+        const test::Outcome sandbox =
+            test::run(*bwrap, {"--ro-bind", "/", "/", "--proc", "/proc", "--dev", "/dev",
+                               "--unshare-pid", "--", "/usr/bin/true"});
+        if (sandbox.status != 0)
+            GTEST_SKIP() << "bubblewrap cannot make a sandbox here: " << sandbox.err;
         std::string why;
         cgroups_ = LaunchCgroup::locate(kCgroupParent, &why);
         if (!cgroups_) GTEST_SKIP() << why;
+        if (const std::string unusable = test::launchCgroupsUnusable(*cgroups_);
+            !unusable.empty()) {
+            cgroups_.reset();
+            GTEST_SKIP() << unusable;
+        }
         // The launcher, the daemon and this program's termination service
         // share a scratch parent group.
         ::setenv("BERTH_LAUNCH_CGROUP", kCgroupParent.c_str(), 1);

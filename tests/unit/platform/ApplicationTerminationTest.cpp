@@ -9,6 +9,7 @@
 
 #include <fstream>
 
+#include "CgroupSupport.h"
 #include "TestSupport.h"
 #include "platform/ApplicationTermination.h"
 
@@ -50,6 +51,11 @@ class CgroupTerminationTest : public ::testing::TestWithParam<bool> {
         parent_ = "berth-test.termination." + std::to_string(::getpid());
         cgroups_ = LaunchCgroup::locate(parent_, &why);
         if (!cgroups_) GTEST_SKIP() << why;
+        if (const std::string unusable = test::launchCgroupsUnusable(*cgroups_);
+            !unusable.empty()) {
+            cgroups_.reset();
+            GTEST_SKIP() << unusable;
+        }
         CgroupApplicationTermination::Options options;
         options.cgroupParent = parent_;
         options.blockDirectory = blocks_ / "terminated";
