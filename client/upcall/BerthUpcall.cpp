@@ -1,5 +1,8 @@
 #include "BerthUpcall.h"
 
+#include <sys/socket.h>
+#include <sys/time.h>
+
 #include <cerrno>
 #include <memory>
 
@@ -152,7 +155,7 @@ std::optional<Reply> decodeReply(std::vector<uint8_t> data, std::string* why) {
 }
 
 std::optional<Answer> call(const Request& request, const std::string& socketPath,
-                           CallFailure* failure) {
+                           CallFailure* failure, std::chrono::milliseconds timeout) {
     int error = 0;
     std::optional<BTHUpcallClient> client = socketPath.empty()
                                                 ? BTHUpcallClient::connect(&error)
@@ -161,6 +164,10 @@ std::optional<Answer> call(const Request& request, const std::string& socketPath
         *failure = {CallFailure::Stage::Connect, error, {}};
         return std::nullopt;
     }
+    struct timeval limit {};
+    limit.tv_sec = static_cast<time_t>(timeout.count() / 1000);
+    limit.tv_usec = static_cast<suseconds_t>(timeout.count() % 1000 * 1000);
+    ::setsockopt(client->socket(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
     const std::vector<uint8_t> data = encodeRequest(request);
     if (data.empty()) {
         *failure = {CallFailure::Stage::Exchange, ENOMEM, {}};
@@ -168,7 +175,7 @@ std::optional<Answer> call(const Request& request, const std::string& socketPath
     }
     std::optional<BTHUpcallAnswer> raw = client->call(data, &error);
     if (!raw) {
-        *failure = {CallFailure::Stage::Exchange, error, {}};
+        *failure = {CallFailure::Stage::Exchange, error == EAGAIN ? ETIMEDOUT : error, {}};
         return std::nullopt;
     }
     Answer answer;

@@ -3,6 +3,7 @@
 // plain fields, and the daemon's answer read back into plain fields.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -56,9 +57,11 @@ struct CallFailure {
 };
 
 // Connects to the daemon's upcall socket (default: in the device root's
-// runtime directory), sends the request and reads the answer.
+// runtime directory), sends the request and reads the answer. No answer
+// within `timeout` fails the exchange with ETIMEDOUT.
 std::optional<Answer> call(const Request& request, const std::string& socketPath,
-                           CallFailure* failure);
+                           CallFailure* failure,
+                           std::chrono::milliseconds timeout = std::chrono::seconds(30));
 
 // The text of a return code ("bad arguments", "not the kernel", ...).
 std::string returnCodeText(int32_t code);

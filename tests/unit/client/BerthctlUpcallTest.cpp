@@ -2,6 +2,12 @@
 // sends, and answers read back, including answers that are not well formed.
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
 #include <functional>
 
 #include "packbuff/packbuff.h"
@@ -113,6 +119,28 @@ TEST(BerthctlUpcallTest, MalformedRepliesAreRefusedWithTheReason) {
     }
     std::string why;
     EXPECT_FALSE(upcall::decodeReply({1, 2, 3}, &why));
+}
+
+TEST(BerthctlUpcallTest, ADaemonThatNeverAnswersTimesOut) {
+    char directory[] = "/tmp/berth-upcall.XXXXXX";
+    ASSERT_TRUE(mkdtemp(directory));
+    const std::string path = std::string(directory) + "/socket";
+    const int listener = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
+    struct sockaddr_un address {};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    ASSERT_EQ(::bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    ASSERT_EQ(::listen(listener, 1), 0);
+
+    upcall::CallFailure failure;
+    const auto started = std::chrono::steady_clock::now();
+    EXPECT_FALSE(upcall::call({}, path, &failure, std::chrono::milliseconds(200)));
+    EXPECT_GE(std::chrono::steady_clock::now() - started, std::chrono::milliseconds(200));
+    EXPECT_EQ(failure.stage, upcall::CallFailure::Stage::Exchange);
+    EXPECT_EQ(failure.error, ETIMEDOUT);
+    ::close(listener);
+    ::unlink(path.c_str());
+    ::rmdir(directory);
 }
 
 }  // namespace
