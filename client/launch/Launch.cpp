@@ -2,8 +2,10 @@
 
 #include <fcntl.h>
 #include <grp.h>
+#include <linux/capability.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -165,78 +167,143 @@ void removeGroup(const LaunchCgroup& cgroups, const std::string& identifier) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
 }
 
+// What must be there before the daemon is asked.
+struct Prerequisites {
+    stdfs::path bwrap;
+    LaunchCgroup cgroups;
+    UserRecord user;
+    stdfs::path program;
+};
+
+std::optional<Prerequisites> checkPrerequisites(const LaunchOptions& options, int* status,
+                                                std::ostream& err) {
+    const std::string& identifier = options.request.signingIdentifier;
+    std::string why;
+    *status = kExitLaunchFailed;
+    if (::geteuid() != 0) {
+        fail(err,
+             "must run as root (it asks berthd as the kernel does and starts programs as "
+             "other users)");
+        return std::nullopt;
+    }
+    if (!LaunchCgroup::validName(identifier, &why)) {
+        *status = fail(err, why, kExitUsage);
+        return std::nullopt;
+    }
+    const std::optional<stdfs::path> bwrap = findProgram("bwrap");
+    if (!bwrap) {
+        fail(err, "bubblewrap is not installed (no bwrap in PATH); install the package bubblewrap");
+        return std::nullopt;
+    }
+    std::optional<LaunchCgroup> cgroups =
+        LaunchCgroup::locate(LaunchCgroup::configuredParent(), &why);
+    if (!cgroups) {
+        fail(err, why);
+        return std::nullopt;
+    }
+    if (std::optional<std::string> reason = RelaunchBlocks().reasonFor(identifier)) {
+        refuseHeld(err, identifier, *reason);
+        return std::nullopt;
+    }
+    std::optional<UserRecord> user = UserDatabase::userById(options.request.persona);
+    if (!user) {
+        fail(err, "no user with uid " + std::to_string(options.request.persona) +
+                      " in the device's user database");
+        return std::nullopt;
+    }
+    std::optional<stdfs::path> program = findProgram(options.program.at(0));
+    if (!program) {
+        *status = fail(err, "program not found: " + options.program[0], kExitNotFound);
+        return std::nullopt;
+    }
+    return Prerequisites{*bwrap, std::move(*cgroups), std::move(*user), std::move(*program)};
+}
+
+// The sandbox for the answered directories; the descriptors it binds go to
+// `fds`.
+std::optional<SandboxPlan> planSandbox(const LaunchOptions& options, const Prerequisites& pre,
+                                       const upcall::Reply& reply, std::vector<UniqueFd>* fds,
+                                       std::ostream& err) {
+    SandboxPlan plan;
+    if (!openContainers(reply, fds, &plan.bindings, err)) return std::nullopt;
+    if (!isSystemProgram(pre.program)) {
+        // The program's own directory (its bundle), read-only.
+        UniqueFd directory = fs::openNoFollow(pre.program.parent_path(), O_PATH | O_DIRECTORY);
+        if (!directory) {
+            fail(err,
+                 "cannot open " + pre.program.parent_path().string() + ": " + std::strerror(errno));
+            return std::nullopt;
+        }
+        plan.bindings.push_back({directory.get(), pre.program.parent_path().string(), false});
+        fds->push_back(std::move(directory));
+    }
+    UniqueFd helper(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
+    if (!helper) {
+        fail(err, "cannot open its own program: " + std::string(std::strerror(errno)));
+        return std::nullopt;
+    }
+    plan.helperFd = helper.get();
+    fds->push_back(std::move(helper));
+    plan.uid = pre.user.uid;
+    plan.gid = pre.user.gid;
+    plan.environment = {{"PATH", "/usr/local/bin:/usr/bin:/bin"},
+                        {"USER", pre.user.name},
+                        {"LOGNAME", pre.user.name},
+                        {"BERTH_DATA_CONTAINER", *reply.dataContainer}};
+    if (reply.home) plan.environment.emplace_back("HOME", *reply.home);
+    if (reply.tmp) plan.environment.emplace_back("TMPDIR", *reply.tmp);
+    plan.workingDirectory = *reply.dataContainer;
+    plan.program = options.program;
+    plan.program[0] = pre.program.string();
+    return plan;
+}
+
+// No program run later may regain a capability (needs privileges: before
+// the uid changes).
+bool dropBoundingSet() {
+    for (int cap = 0; cap <= CAP_LAST_CAP; ++cap)
+        if (::prctl(PR_CAPBSET_DROP, cap, 0, 0, 0) != 0 && errno != EINVAL) return false;
+    return ::prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_CLEAR_ALL, 0, 0, 0) == 0;
+}
+
+// Empties the process's own capability sets, which a uid 0 persona keeps.
+bool clearCapabilities() {
+    struct __user_cap_header_struct header {
+        _LINUX_CAPABILITY_VERSION_3, 0
+    };
+    struct __user_cap_data_struct data[2] = {};
+    return ::syscall(SYS_capset, &header, data) == 0;
+}
+
 }  // namespace
 
 int runLaunch(const LaunchOptions& options, std::ostream& err) {
     const std::string& identifier = options.request.signingIdentifier;
-    std::string why;
-    if (::geteuid() != 0)
-        return fail(err,
-                    "must run as root (it asks berthd as the kernel does and starts "
-                    "programs as other users)");
-    if (!LaunchCgroup::validName(identifier, &why)) return fail(err, why, kExitUsage);
-    const std::optional<stdfs::path> bwrap = findProgram("bwrap");
-    if (!bwrap)
-        return fail(err,
-                    "bubblewrap is not installed (no bwrap in PATH); install the package "
-                    "bubblewrap");
-    const std::optional<LaunchCgroup> cgroups =
-        LaunchCgroup::locate(LaunchCgroup::configuredParent(), &why);
-    if (!cgroups) return fail(err, why);
-    if (std::optional<std::string> reason = RelaunchBlocks().reasonFor(identifier))
-        return refuseHeld(err, identifier, *reason);
-    const std::optional<UserRecord> user = UserDatabase::userById(options.request.persona);
-    if (!user)
-        return fail(err, "no user with uid " + std::to_string(options.request.persona) +
-                             " in the device's user database");
-    const std::optional<stdfs::path> program = findProgram(options.program.at(0));
-    if (!program) return fail(err, "program not found: " + options.program[0], kExitNotFound);
-
+    int status = 0;
+    const std::optional<Prerequisites> pre = checkPrerequisites(options, &status, err);
+    if (!pre) return status;
     const std::optional<upcall::Reply> reply = askDaemon(options, err);
     if (!reply) return kExitLaunchFailed;
     std::vector<UniqueFd> fds;
-    SandboxPlan plan;
-    if (!openContainers(*reply, &fds, &plan.bindings, err)) return kExitLaunchFailed;
-    if (!isSystemProgram(*program)) {
-        // The program's own directory (its bundle), read-only.
-        UniqueFd directory = fs::openNoFollow(program->parent_path(), O_PATH | O_DIRECTORY);
-        if (!directory)
-            return fail(err, "cannot open " + program->parent_path().string() + ": " +
-                                 std::strerror(errno));
-        plan.bindings.push_back({directory.get(), program->parent_path().string(), false});
-        fds.push_back(std::move(directory));
-    }
-    UniqueFd helper(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
-    if (!helper) return fail(err, "cannot open its own program: " + std::string(strerror(errno)));
-    plan.helperFd = helper.get();
-    plan.uid = user->uid;
-    plan.gid = user->gid;
-    plan.environment = {{"PATH", "/usr/local/bin:/usr/bin:/bin"},
-                        {"USER", user->name},
-                        {"LOGNAME", user->name},
-                        {"BERTH_DATA_CONTAINER", *reply->dataContainer}};
-    if (reply->home) plan.environment.emplace_back("HOME", *reply->home);
-    if (reply->tmp) plan.environment.emplace_back("TMPDIR", *reply->tmp);
-    plan.workingDirectory = *reply->dataContainer;
-    plan.program = options.program;
-    plan.program[0] = program->string();
+    const std::optional<SandboxPlan> plan = planSandbox(options, *pre, *reply, &fds, err);
+    if (!plan) return kExitLaunchFailed;
 
-    std::vector<std::string> argv = {bwrap->string()};
-    for (std::string& arg : bubblewrapArguments(plan)) argv.push_back(std::move(arg));
-    std::vector<int> inherited = {helper.get()};
+    std::vector<std::string> argv = {pre->bwrap.string()};
+    for (std::string& arg : bubblewrapArguments(*plan)) argv.push_back(std::move(arg));
+    std::vector<int> inherited;
     for (const UniqueFd& fd : fds) inherited.push_back(fd.get());
 
-    UniqueFd group = cgroups->create(identifier);
+    UniqueFd group = pre->cgroups.create(identifier);
     if (!group)
-        return fail(err, "cannot create the launch cgroup " + cgroups->pathOf(identifier).string() +
-                             ": " + std::strerror(errno));
+        return fail(err, "cannot create the launch cgroup " +
+                             pre->cgroups.pathOf(identifier).string() + ": " +
+                             std::strerror(errno));
     const pid_t pid = ::fork();
     if (pid < 0) return fail(err, "fork: " + std::string(std::strerror(errno)));
     if (pid == 0) startSandbox(group.get(), identifier, argv, inherited);
-    int status = 0;
     while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
     }
-    removeGroup(*cgroups, identifier);
+    removeGroup(pre->cgroups, identifier);
     if (WIFSIGNALED(status)) {
         err << "berth-launch: " << identifier << " ended by signal " << WTERMSIG(status) << "\n";
         return 128 + WTERMSIG(status);
@@ -245,9 +312,11 @@ int runLaunch(const LaunchOptions& options, std::ostream& err) {
 }
 
 int runAsPersona(uid_t uid, gid_t gid, const std::vector<std::string>& program, std::ostream& err) {
-    if (::setgroups(1, &gid) != 0 || ::setresgid(gid, gid, gid) != 0 ||
-        ::setresuid(uid, uid, uid) != 0 || ::getuid() != uid || ::geteuid() != uid)
-        return fail(err, "cannot become uid " + std::to_string(uid) + ": " + std::strerror(errno));
+    if (::setgroups(1, &gid) != 0 || ::setresgid(gid, gid, gid) != 0 || !dropBoundingSet() ||
+        ::setresuid(uid, uid, uid) != 0 || ::getuid() != uid || ::geteuid() != uid ||
+        !clearCapabilities())
+        return fail(err, "cannot become uid " + std::to_string(uid) +
+                             " without privileges: " + std::strerror(errno));
     // No way back to privileges through a set-user-id program.
     ::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0);
     std::vector<char*> pointers;

@@ -185,6 +185,17 @@ TEST_F(BerthLaunchTest, TheProgramSeesOnlyItsContainersAsThePersona) {
     EXPECT_FALSE(fs::exists(cgroups_->pathOf("com.example.sandboxed")));
 }
 
+TEST_F(BerthLaunchTest, EvenARootPersonaRunsWithoutCapabilities) {
+    const test::Outcome outcome =
+        Launch({"--identifier", "com.example.rooted", "--persona", "0", "--", "/bin/sh", "-c",
+                "id -u; grep -E '^Cap(Eff|Prm|Bnd)' /proc/self/status"})
+            .wait();
+    ASSERT_EQ(outcome.status, 0) << outcome.err;
+    EXPECT_EQ(outcome.out,
+              "0\nCapPrm:\t0000000000000000\nCapEff:\t0000000000000000\n"
+              "CapBnd:\t0000000000000000\n");
+}
+
 TEST_F(BerthLaunchTest, AContainerSwappedForALinkIsNeverBound) {
     // Another process of the app's user swaps its group container for a link
     // to another app's container. The daemon's look-up already refuses it
