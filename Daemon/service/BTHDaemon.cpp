@@ -13,6 +13,7 @@
 #include <cstring>
 #include <optional>
 
+#include "BTHApplicationTerminationAssertion.h"
 #include "BTHAsyncWork.h"
 #include "BTHClientConnection.h"
 #include "BTHError.h"
@@ -191,6 +192,9 @@ int BTHDaemonMain() {
         BTHLogError("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting.");
         return -1;
     }
+    // Holding the upcall endpoint makes this the device's one daemon: blocks
+    // left by a previous one died with its assertions.
+    BTHApplicationTerminationAssertion::clearStaleRelaunchBlocks();
     registerForLockStateChanges(runLoop);
 
     if (firstBoot) {

@@ -18,6 +18,7 @@
 #include "LockCommand.h"
 #include "SendCommand.h"
 #include "SignCommand.h"
+#include "UpcallCommand.h"
 
 namespace {
 
@@ -32,6 +33,7 @@ struct Arguments {
     bool signList = false;
     ContainerOptions container;
     uint32_t user = 1;
+    UpcallOptions upcall;
 };
 
 std::chrono::milliseconds timeoutOf(double seconds) {
@@ -145,6 +147,26 @@ CLI::App* addContainerCommand(CLI::App& parent, const char* name, const char* de
     return command;
 }
 
+// "upcall": a process-containers request as the kernel sends it.
+CLI::App* addUpcallCommand(CLI::App& app, UpcallOptions& options) {
+    berth::upcall::Request& request = options.request;
+    CLI::App* command = app.add_subcommand(
+        "upcall", "Ask for a starting process's containers as the kernel does (root only)");
+    command->add_option("--identifier", request.signingIdentifier, "The signing identifier")
+        ->required();
+    command->add_option("--container-identifier", request.containerIdentifier,
+                        "The data container's identifier, when it differs");
+    command->add_option("--persona", request.persona, "The user whose containers are meant")
+        ->required();
+    command->add_flag("--plugin", request.plugin, "A plug-in (container type 1)");
+    command->add_option("--group", request.groups, "An application group; repeat for more");
+    command->add_option("--system-container", request.systemContainer,
+                        "The system container's identifier");
+    command->add_option("--system-group", request.systemGroups, "A system group; repeat for more");
+    command->add_option("--socket", options.socket, "Upcall socket (default: the daemon's)");
+    return command;
+}
+
 // Checks what CLI11 cannot: which positionals the chosen sign action needs.
 void validateSign(Arguments& args) {
     if (args.signRemove && args.signList)
@@ -203,6 +225,7 @@ int main(int argc, char** argv) {
     CLI::App* lock = app.add_subcommand("lock", "Lock the device (key bag lock state)");
     CLI::App* unlock = app.add_subcommand("unlock", "Unlock the device");
     CLI::App* commands = app.add_subcommand("commands", "List the daemon's commands");
+    CLI::App* upcall = addUpcallCommand(app, args.upcall);
 
     std::vector<CLI::App*> containerCommands;
     containerCommands.push_back(addContainerCommand(app, "create", "Create a container, or find it",
@@ -287,5 +310,9 @@ int main(int argc, char** argv) {
     if (lock->parsed() || unlock->parsed())
         return runSetLockState(lock->parsed(), args.json, std::cout, std::cerr);
     if (commands->parsed()) return runListCommands(args.json, std::cout);
+    if (upcall->parsed()) {
+        args.upcall.json = args.json;
+        return runUpcall(args.upcall, std::cout, std::cerr);
+    }
     return kExitUsage;
 }
