@@ -75,6 +75,7 @@ class BulkDirectoryReader {
 
     std::unique_ptr<unsigned char[]> buffer_;
     std::unique_ptr<Attributes> attributes_;
+    std::vector<size_t> pending_;  // entries of the batch that need attributes
 };
 
 }  // namespace berth::fs
