@@ -85,15 +85,16 @@ void takeStatx(const struct statx& sx, BulkEntry* entry) {
 // for in one submission: the kernel fetches them in parallel on its own
 // workers while this thread waits once. Otherwise one statx per entry.
 struct BulkDirectoryReader::Attributes {
-#if BERTH_HAVE_LIBURING
+#if !BERTH_HAVE_LIBURING
+    explicit Attributes(bool) {}
+#else
     static constexpr unsigned kDepth = 256;
     io_uring ring{};
     bool ready = false;
     std::vector<struct statx> answers = std::vector<struct statx>(kDepth);
-    std::vector<size_t> indexes = std::vector<size_t>(kDepth);
 
-    Attributes() {
-        ready = ::io_uring_queue_init(kDepth, &ring, 0) == 0;
+    explicit Attributes(bool batched) {
+        ready = batched && ::io_uring_queue_init(kDepth, &ring, 0) == 0;
     }
     ~Attributes() {
         if (ready) ::io_uring_queue_exit(&ring);
@@ -135,9 +136,9 @@ struct BulkDirectoryReader::Attributes {
 #endif
 };
 
-BulkDirectoryReader::BulkDirectoryReader()
+BulkDirectoryReader::BulkDirectoryReader(bool batched)
     : buffer_(std::make_unique<unsigned char[]>(kBufferSize)),
-      attributes_(std::make_unique<Attributes>()) {}
+      attributes_(std::make_unique<Attributes>(batched)) {}
 
 BulkDirectoryReader::~BulkDirectoryReader() = default;
 

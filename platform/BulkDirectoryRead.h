@@ -57,7 +57,9 @@ class BulkDirectoryReader {
   public:
     static constexpr size_t kBufferSize = 32768;
 
-    BulkDirectoryReader();
+    // `batched` false asks the attributes one entry at a time even where
+    // batching is available (both ways answer alike).
+    explicit BulkDirectoryReader(bool batched = true);
     ~BulkDirectoryReader();
     BulkDirectoryReader(const BulkDirectoryReader&) = delete;
     BulkDirectoryReader& operator=(const BulkDirectoryReader&) = delete;

@@ -217,6 +217,12 @@ TEST_F(UsageDaemonTest, RefusesClassTwoAndStrongClassesForThirdParties) {
     // The class already held: success, and no file is touched.
     EXPECT_EQ(code(protect("sys.kelp.protect.refusals", 0)), 1u);
     EXPECT_FALSE(ownClass(path / "Documents"));
+
+    // Without any user-data item there is nothing to change, and the class
+    // is still recorded.
+    for (const char* item : {"Documents", "Library", "tmp"}) fs::remove_all(path / item);
+    EXPECT_EQ(code(protect("sys.kelp.protect.refusals", 3)), 1u);
+    EXPECT_EQ(infoValue(data, kClassKey), Value(int64_t{3}));
 }
 
 // Lowering re-classes directories and files but spares files of class 2 and
