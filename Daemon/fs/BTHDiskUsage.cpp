@@ -14,9 +14,15 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <condition_variable>
 #include <deque>
+#include <mutex>
+#include <optional>
+#include <thread>
 #include <unordered_set>
+#include <vector>
 
 #include "BTHFileManager+Internal.h"
 #include "BTHFileManager.h"
@@ -56,8 +62,10 @@ UniqueFd openBeneath(int rootFd, const std::string& relative) {
 }
 
 // One measurement: the work list of directories still to read (paths
-// relative to the root), the total, and the files with several links
-// already counted.
+// relative to the root, first in first out), the files with several links
+// already counted, and the readers. Large trees are read by a few threads
+// at once, each with its own reader and buffer, taking directories from the
+// shared list; the total is the same whichever thread reads what.
 class DiskUsageWalk {
   public:
     explicit DiskUsageWalk(const std::filesystem::path& root) : root_(root) {}
@@ -65,57 +73,112 @@ class DiskUsageWalk {
     uint64_t run();
 
   private:
+    // What one thread reads with, and what it has counted.
+    struct Reader {
+        fs::BulkDirectoryReader bulk;
+        std::vector<fs::BulkEntry> batch;
+        std::vector<std::string> children;  // of the directory being read
+        uint64_t total = 0;
+    };
+
     std::filesystem::path pathOf(const std::string& relative) const {
         return relative.empty() ? root_ : root_ / relative;
     }
-    void readDirectory(int dirFd, const std::string& relative);
-    void take(const fs::BulkEntry& entry, uint64_t entryNumber, const std::string& relative);
+    void work(Reader& reader);
+    std::optional<std::string> nextDirectory();
+    void finishDirectory(Reader& reader);
+    void readDirectory(Reader& reader, int dirFd, const std::string& relative);
+    void take(Reader& reader, const fs::BulkEntry& entry, uint64_t entryNumber,
+              const std::string& relative);
+
+    // More threads than cores only wait; a few are enough to keep the file
+    // system's caches busy.
+    static constexpr unsigned kMaxReaders = 4;
 
     std::filesystem::path root_;
+    UniqueFd rootFd_;
+    std::mutex mutex_;
+    std::condition_variable changed_;
     std::deque<std::string> work_;
-    uint64_t total_ = 0;
+    size_t reading_ = 0;  // directories taken and not yet finished
     std::unordered_set<FileId, FileIdHash> counted_;
-    fs::BulkDirectoryReader reader_;
-    std::vector<fs::BulkEntry> batch_;
 };
 
 uint64_t DiskUsageWalk::run() {
     BTH_FUNCTION("-[BTHFileManager diskUsageForURL:]");
-    UniqueFd rootFd = fs::openNoFollow(root_, O_RDONLY | O_DIRECTORY);
-    if (!rootFd) {
+    rootFd_ = fs::openNoFollow(root_, O_RDONLY | O_DIRECTORY);
+    if (!rootFd_) {
         BTHLogError("Failed to open directory %@ : %s", root_, errorText(errno));
         return 0;
     }
-    readDirectory(rootFd.get(), std::string());
-    while (!work_.empty()) {
-        const std::string relative = std::move(work_.front());
-        work_.pop_front();
-        UniqueFd dirFd = openBeneath(rootFd.get(), relative);
-        if (!dirFd) {
-            BTHLogError("Failed to open directory %@ : %s", pathOf(relative), errorText(errno));
-            continue;
-        }
-        readDirectory(dirFd.get(), relative);
-    }
-    return total_;
+    Reader first;
+    readDirectory(first, rootFd_.get(), std::string());
+    finishDirectory(first);
+    const unsigned cores = std::max(1u, std::thread::hardware_concurrency());
+    // A root without subdirectories is done; otherwise the others read too.
+    const size_t helpers = work_.empty() ? 0 : std::min(cores, kMaxReaders) - 1;
+    std::vector<Reader> readers(helpers);
+    std::vector<std::thread> threads;
+    for (Reader& reader : readers) threads.emplace_back([this, &reader] { work(reader); });
+    work(first);
+    for (std::thread& thread : threads) thread.join();
+    uint64_t total = first.total;
+    for (const Reader& reader : readers) total += reader.total;
+    return total;
 }
 
-void DiskUsageWalk::readDirectory(int dirFd, const std::string& relative) {
+void DiskUsageWalk::work(Reader& reader) {
+    BTH_FUNCTION("-[BTHFileManager diskUsageForURL:]");
+    while (std::optional<std::string> relative = nextDirectory()) {
+        UniqueFd dirFd = openBeneath(rootFd_.get(), *relative);
+        if (dirFd)
+            readDirectory(reader, dirFd.get(), *relative);
+        else
+            BTHLogError("Failed to open directory %@ : %s", pathOf(*relative), errorText(errno));
+        finishDirectory(reader);
+    }
+}
+
+// The next directory to read; none once the list is empty and no directory
+// being read can add to it.
+std::optional<std::string> DiskUsageWalk::nextDirectory() {
+    std::unique_lock lock(mutex_);
+    changed_.wait(lock, [this] { return !work_.empty() || reading_ == 0; });
+    if (work_.empty()) return std::nullopt;
+    std::string relative = std::move(work_.front());
+    work_.pop_front();
+    ++reading_;
+    return relative;
+}
+
+// Hands the children of the directory just read to the list.
+void DiskUsageWalk::finishDirectory(Reader& reader) {
+    {
+        std::lock_guard lock(mutex_);
+        for (std::string& child : reader.children) work_.push_back(std::move(child));
+        if (reading_ > 0) --reading_;
+    }
+    reader.children.clear();
+    changed_.notify_all();
+}
+
+void DiskUsageWalk::readDirectory(Reader& reader, int dirFd, const std::string& relative) {
     BTH_FUNCTION("-[BTHFileManager diskUsageForURL:]");
     uint64_t entryNumber = 0;
     for (;;) {
-        const int n = reader_.read(dirFd, &batch_);
+        const int n = reader.bulk.read(dirFd, &reader.batch);
         if (n == 0) return;
         if (n < 0) {
             BTHLogError("getattrlistbulk on entry %llu in %@ returned error %s", entryNumber,
                         pathOf(relative), errorText(errno));
             return;
         }
-        for (const fs::BulkEntry& entry : batch_) take(entry, entryNumber++, relative);
+        for (const fs::BulkEntry& entry : reader.batch)
+            take(reader, entry, entryNumber++, relative);
     }
 }
 
-void DiskUsageWalk::take(const fs::BulkEntry& entry, uint64_t entryNumber,
+void DiskUsageWalk::take(Reader& reader, const fs::BulkEntry& entry, uint64_t entryNumber,
                          const std::string& relative) {
     BTH_FUNCTION("-[BTHFileManager diskUsageForURL:]");
     using Entry = fs::BulkEntry;
@@ -142,20 +205,24 @@ void DiskUsageWalk::take(const fs::BulkEntry& entry, uint64_t entryNumber,
         std::string child = relative;
         if (!child.empty()) child += '/';
         child.append(entry.name);
-        work_.push_back(std::move(child));
+        reader.children.push_back(std::move(child));
         return;
     }
     const uint64_t size = entry.has(Entry::kAllocSize) ? entry.allocSize : 0;
     if (entry.has(Entry::kLinkCount) && entry.linkCount == 1) {
-        total_ += size;
+        reader.total += size;
         return;
     }
-    const FileId id{entry.device, entry.fileId};
-    if (!counted_.insert(id).second) {
+    bool first;
+    {
+        std::lock_guard lock(mutex_);
+        first = counted_.insert(FileId{entry.device, entry.fileId}).second;
+    }
+    if (!first) {
         BTHLogDebug("Skipping hardlinked file at %@/%s", pathOf(relative), std::string(entry.name));
         return;
     }
-    total_ += size;
+    reader.total += size;
 }
 
 }  // namespace
