@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 
 #if BERTH_HAVE_LIBURING
@@ -91,22 +92,25 @@ struct BulkDirectoryReader::Attributes {
     static constexpr unsigned kDepth = 256;
     io_uring ring{};
     bool ready = false;
+    bool failed = false;  // set up, then failed
     std::vector<struct statx> answers = std::vector<struct statx>(kDepth);
 
     explicit Attributes(bool batched) {
         ready = batched && ::io_uring_queue_init(kDepth, &ring, 0) == 0;
     }
     ~Attributes() {
-        if (ready) ::io_uring_queue_exit(&ring);
+        if (ready || failed) ::io_uring_queue_exit(&ring);
     }
 
-    // Fetches the attributes of `entries` at `pending` (at most kDepth);
-    // false when the ring failed and nothing can be said of them.
+    // Fetches the attributes of `entries` at `pending` (at most kDepth).
+    // False when the ring failed; every request it took has then been
+    // answered (the kernel writes nothing later) and the ring is not used
+    // again.
     bool fetch(int dirFd, std::vector<BulkEntry>& entries, const std::vector<size_t>& pending,
                size_t first, size_t count) {
         for (size_t i = 0; i < count; ++i) {
             io_uring_sqe* sqe = ::io_uring_get_sqe(&ring);
-            if (!sqe) return false;
+            if (!sqe) return false;  // never: the ring is empty between batches
             BulkEntry& entry = entries[pending[first + i]];
             ::io_uring_prep_statx(sqe, dirFd, entry.name.data(), kStatxFlags, kStatxMask,
                                   &answers[i]);
@@ -115,11 +119,16 @@ struct BulkDirectoryReader::Attributes {
             // attempt and hand it to a worker at once.
             sqe->flags |= IOSQE_ASYNC;
         }
-        if (::io_uring_submit_and_wait(&ring, static_cast<unsigned>(count)) < 0) return false;
-        size_t seen = 0;
-        while (seen < count) {
+        int submitted;
+        do submitted = ::io_uring_submit(&ring);
+        while (submitted == -EINTR);
+        bool complete = submitted == static_cast<int>(count);
+        for (int seen = 0; seen < std::max(submitted, 0); ++seen) {
             io_uring_cqe* cqe = nullptr;
-            if (::io_uring_wait_cqe(&ring, &cqe) != 0) return false;
+            int err;
+            do err = ::io_uring_wait_cqe(&ring, &cqe);
+            while (err == -EINTR);
+            if (err != 0) std::abort();  // requests in flight could write later: unrecoverable
             const size_t i = ::io_uring_cqe_get_data64(cqe);
             BulkEntry& entry = entries[pending[first + i]];
             if (cqe->res < 0) {
@@ -129,9 +138,8 @@ struct BulkDirectoryReader::Attributes {
                 takeStatx(answers[i], &entry);
             }
             ::io_uring_cqe_seen(&ring, cqe);
-            ++seen;
         }
-        return true;
+        return complete;
     }
 #endif
 };
@@ -188,10 +196,10 @@ void BulkDirectoryReader::fetchAttributes(int dirFd, std::vector<BulkEntry>* ent
                 attributes_->fetch(dirFd, *entries, pending_, first,
                                    std::min<size_t>(Attributes::kDepth, pending_.size() - first));
         if (fetched) return;
-        // A ring that failed is not trusted again; this batch is fetched
-        // one entry at a time.
-        ::io_uring_queue_exit(&attributes_->ring);
+        // A ring that failed is not trusted again (it is closed when the
+        // reader goes); this batch is fetched one entry at a time.
         attributes_->ready = false;
+        attributes_->failed = true;
         for (size_t i : pending_) (*entries)[i].returned &= BulkEntry::kName | BulkEntry::kType;
     }
 #endif
