@@ -214,6 +214,8 @@ TEST_F(UsageDaemonTest, RefusesClassTwoAndStrongClassesForThirdParties) {
     EXPECT_EQ(code(protect("sys.kelp.protect.none", 3)), 21u);
     Value wrongClass = request(21, 1, 33, "sys.kelp.protect.refusals");
     EXPECT_EQ(code(call(wrongClass)), 11u);
+    // A user not valid for the class is answered at once by the intake.
+    EXPECT_EQ(code(call(request(21, 1, 501, "sys.kelp.protect.refusals"))), 38u);
     // The class already held: success, and no file is touched.
     EXPECT_EQ(code(protect("sys.kelp.protect.refusals", 0)), 1u);
     EXPECT_FALSE(ownClass(path / "Documents"));
