@@ -157,7 +157,9 @@ std::string BTHLogEscape(std::string_view text) {
     out.reserve(text.size());
     for (size_t i = 0; i < text.size();) {
         const unsigned char c = static_cast<unsigned char>(text[i]);
-        if (c >= 0x20 && c < 0x7F) {
+        // A tab moves the cursor but never to another line, and some of the
+        // daemon's own lines are indented with one.
+        if ((c >= 0x20 && c < 0x7F) || c == '\t') {
             out.push_back(static_cast<char>(c));
             ++i;
             continue;
@@ -181,9 +183,6 @@ std::string BTHLogEscape(std::string_view text) {
                 break;
             case '\r':
                 out += "\\r";
-                break;
-            case '\t':
-                out += "\\t";
                 break;
             default:
                 std::snprintf(buffer, sizeof buffer, "\\x%02X", c);

@@ -87,9 +87,9 @@ class BTHLogIdentifierScope {
     const BTHLogIdentifierScope* outer_;
 };
 
-// `text` made safe to be one line of a log: control characters (C0, DEL,
-// C1), the line and paragraph separators and bytes that are not UTF-8 are
-// written as escapes ("\n", "\r", "\t", "\x1B", "\u0085", "\u2028"); one
+// `text` made safe to be one line of a log: control characters (C0 but the
+// tab, DEL, C1), the line and paragraph separators and bytes that are not
+// UTF-8 are written as escapes ("\n", "\r", "\x1B", "\u0085", "\u2028"); one
 // trailing newline is dropped. Every line written goes through it, so a
 // client's identifier or a name read from disk can never start a line of
 // its own.

@@ -208,6 +208,36 @@ class BTHFileManager {
     bool standardizeOwnershipAtURL(const std::filesystem::path& url, uid_t uid, gid_t gid,
                                    BTHErrorRef* error);
 
+    // ----- Disk usage and protection classes (BTHDiskUsage.cpp,
+    // BTHFileManager+Protection.cpp)
+
+    // The bytes allocated to the files of the tree at `url` (allocation, not
+    // length; directories' own blocks left out; a file with several links
+    // counted once per call, wherever its links are). Breadth first; no link
+    // is followed, the root included (a link there gives 0); a directory
+    // swapped for a link mid-walk is left out. Never fails: what cannot be
+    // read is logged and left out, so the result is a lower bound.
+    uint64_t diskUsageForURL(const std::filesystem::path& url);
+
+    // Logs (error level) every item left in the tree at `url`, one line
+    // each; changes nothing.
+    void printDirectoryStructureAtURL(const std::filesystem::path& url);
+
+    // The protection class of the item at `url` (own or inherited), read
+    // through a descriptor opened without following a link. Fails with the
+    // open's error ("Failed to open %s : %s"; a link gives ELOOP) or the
+    // class store's ("Failed to getclass of file %s: %s"; EPERM for an item
+    // of class 1 while the device is locked).
+    bool dataProtectionClassOfItemAtURL(const std::filesystem::path& url, int32_t* protectionClass,
+                                        BTHErrorRef* error);
+    // Gives the item at `url` the class, unless `predicate` (given the
+    // current class) answers false, which succeeds without a change.
+    using ProtectionPredicate = std::function<bool(int32_t currentClass)>;
+    bool setDataProtectionClassOfItemAtURL(const std::filesystem::path& url,
+                                           int32_t protectionClass,
+                                           const ProtectionPredicate& predicate,
+                                           BTHErrorRef* error);
+
   private:
     BTHFileManager() = default;
     bool copyItem(const std::filesystem::path& source, const std::filesystem::path& dest,

@@ -150,6 +150,17 @@ class BTHClientConnection {
                                          const std::optional<std::string>& identifier,
                                          uint64_t containerClass, uint64_t* error);
 
+    // ----- Disk usage (BTHClientConnection+DiskUsage.cpp)
+
+    // The bytes the container's files occupy, measured under its identifier
+    // lock for writing. A bundle container is measured once: the result is
+    // kept as its info value "sys.kelp.Lading.StaticDiskUsage" and answered
+    // from there afterwards, unchecked. 0 with 11 for a missing UUID or an
+    // invalid class, 0 with 21 for an unknown container.
+    uint64_t diskUsageForUserId(uid_t userId, const std::optional<Uuid>& uuid,
+                                const std::optional<std::string>& identifier,
+                                uint64_t containerClass, uint64_t* error);
+
     // ----- Death row (BTHClientConnection+DeathRow.cpp)
 
     // Moves the item into a fresh directory of its own on death row (a

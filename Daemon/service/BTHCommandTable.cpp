@@ -2,6 +2,8 @@
 
 #include "BTHContainerCommands.h"
 #include "BTHError.h"
+#include "BTHProtectionCommands.h"
+#include "BTHUsageCommands.h"
 
 namespace berth {
 
@@ -33,7 +35,9 @@ constexpr struct {
     {10, deleteContainer},
     {11, wipePluginDataContainer},
     {12, wipeDataContainer},
+    {21, setDataProtection},
     {22, recreateDefaultStructure},
+    {23, diskUsage},
 };
 
 BTHCommandHandler handlerOf(uint64_t command) {

@@ -19,6 +19,7 @@
 #include "SendCommand.h"
 #include "SignCommand.h"
 #include "UpcallCommand.h"
+#include "UsageCommands.h"
 
 namespace {
 
@@ -34,6 +35,7 @@ struct Arguments {
     ContainerOptions container;
     uint32_t user = 1;
     UpcallOptions upcall;
+    UsageOptions usage;
 };
 
 std::chrono::milliseconds timeoutOf(double seconds) {
@@ -167,6 +169,38 @@ CLI::App* addUpcallCommand(CLI::App& app, UpcallOptions& options) {
     return command;
 }
 
+// "usage" and "protect": which container, and for protect the class.
+CLI::App* addUsageCommand(CLI::App& app, UsageOptions::Action action, Arguments& args) {
+    const bool protect = action == UsageOptions::Action::Protect;
+    CLI::App* command =
+        protect ? app.add_subcommand("protect",
+                                     "Move a data container's user data to another "
+                                     "protection class")
+                : app.add_subcommand("usage", "Print the bytes a container's files occupy");
+    UsageOptions& usage = args.usage;
+    command->callback([&usage, action] { usage.action = action; });
+    command
+        ->add_option("--class", usage.containerClass,
+                     "Container class: 1-13 or a name such as Data/Application")
+        ->required();
+    command->add_option("--user", usage.user, "User id; 1 (default) is your own user");
+    addIdentifierOption(command, "--identifier", "Container identifier (default: your own)",
+                        usage.identifier);
+    if (protect) {
+        command->add_option("protection-class", usage.protectionClass, "The class to apply")
+            ->required();
+        command->add_flag("--third-party", usage.thirdParty,
+                          "The app is a third party's (only classes 0, 1 and 3 allowed)");
+        command->add_flag("--wait", usage.wait,
+                          "If the device is locked, wait for the next unlock and the reply");
+    } else {
+        command->add_option("--uuid", usage.uuid,
+                            "The container's UUID (default: looked up by identifier)");
+    }
+    addConnectionOptions(command, args);
+    return command;
+}
+
 // Checks what CLI11 cannot: which positionals the chosen sign action needs.
 void validateSign(Arguments& args) {
     if (args.signRemove && args.signList)
@@ -226,6 +260,8 @@ int main(int argc, char** argv) {
     CLI::App* unlock = app.add_subcommand("unlock", "Unlock the device");
     CLI::App* commands = app.add_subcommand("commands", "List the daemon's commands");
     CLI::App* upcall = addUpcallCommand(app, args.upcall);
+    CLI::App* usage = addUsageCommand(app, UsageOptions::Action::Usage, args);
+    CLI::App* protect = addUsageCommand(app, UsageOptions::Action::Protect, args);
 
     std::vector<CLI::App*> containerCommands;
     containerCommands.push_back(addContainerCommand(app, "create", "Create a container, or find it",
@@ -302,6 +338,12 @@ int main(int argc, char** argv) {
         args.container.socket = args.send.socket;
         args.container.timeout = timeoutOf(args.timeoutSeconds);
         return runContainerCommand(args.container, std::cout, std::cerr);
+    }
+    if (usage->parsed() || protect->parsed()) {
+        args.usage.json = args.json;
+        args.usage.socket = args.send.socket;
+        args.usage.timeout = timeoutOf(args.timeoutSeconds);
+        return runUsageCommand(args.usage, std::cout, std::cerr);
     }
     if (sign->parsed()) {
         args.sign.json = args.json;

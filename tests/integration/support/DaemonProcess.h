@@ -16,13 +16,13 @@ namespace berth::test {
 
 // How a daemon is started beyond its device root.
 struct DaemonLaunch {
-    std::map<std::string, std::string> environment;
+    std::map<std::string, std::string> environment{};
     // Listening sockets handed over as the service manager does: from
     // descriptor 3 on, with LISTEN_PID, LISTEN_FDS and LISTEN_FDNAMES.
-    std::vector<std::pair<std::string, int>> passedSockets;
+    std::vector<std::pair<std::string, int>> passedSockets{};
     // A program that starts the daemon for us; the daemon's path is
     // appended to these arguments.
-    std::vector<std::string> launcher;
+    std::vector<std::string> launcher{};
 };
 
 class DaemonProcess {

@@ -92,7 +92,7 @@ TEST(BTHLogTest, EveryLineBreakerIsEscapedAndOtherTextKept) {
         {"fake\r<error> main: forged", "fake\\r<error> main: forged"},
         {"\x1b[2K\rforged", "\\x1B[2K\\rforged"},
         {std::string("nul\0byte", 8), "nul\\x00byte"},
-        {"tab\tdel\x7f", "tab\\tdel\\x7F"},
+        {"\tindented del\x7f", "\tindented del\\x7F"},
         {"next\xc2\x85line", "next\\u0085line"},  // C1 NEL
         {"csi\xc2\x9b"
          "2J",

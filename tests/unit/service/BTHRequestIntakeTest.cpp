@@ -55,7 +55,7 @@ Value command(uint64_t n) {
 // 49.
 uint64_t reachedHandler(uint64_t command) {
     if (command == 3) return BTHErrorSuccess;
-    for (uint64_t validating : {0, 1, 2, 5, 6, 7, 8, 9, 10, 11, 12, 22})
+    for (uint64_t validating : {0, 1, 2, 5, 6, 7, 8, 9, 10, 11, 12, 21, 22, 23})
         if (command == validating) return BTHErrorInvalidParameter;
     return BTHErrorInvalidCommand;
 }
