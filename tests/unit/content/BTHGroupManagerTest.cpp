@@ -36,9 +36,9 @@ class BTHGroupManagerTest : public ::testing::Test {
 
     void grant(const std::string& identifier, const Strings& list,
                const char* key = kBTHApplicationGroupsEntitlement) {
-        ASSERT_EQ(mapping_->processCodeSigningInfo(entitlements(key, list), identifier,
-                                                   std::nullopt),
-                  1u);
+        ASSERT_EQ(
+            mapping_->processCodeSigningInfo(entitlements(key, list), identifier, std::nullopt),
+            1u);
     }
 
     // The group containers of `identifier` for `user`, created on demand.
@@ -64,15 +64,16 @@ TEST_F(BTHGroupManagerTest, SharedGroupStaysUntilItsLastReferenceGoes) {
     EXPECT_TRUE(client_->allowGroupIdLookup());
     // The same group is the same container for every member, under class 7.
     EXPECT_EQ(paths(mobile_, "two.app").at("group.shared"), one.at("group.shared"));
-    const stdfs::path classDirectory = *BTHGlobalConfiguration::sharedInstance()
-                                            .containerDirectoryURLForUser(
-                                                mobile_, BTHContainerClassSharedAppGroup, false);
-    for (const auto& [group, path] : one) EXPECT_EQ(stdfs::path(path).parent_path(), classDirectory);
+    const stdfs::path classDirectory =
+        *BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+            mobile_, BTHContainerClassSharedAppGroup, false);
+    for (const auto& [group, path] : one)
+        EXPECT_EQ(stdfs::path(path).parent_path(), classDirectory);
 
     test::LogCapture log;
     grant("one.app", {});
-    EXPECT_TRUE(log.contains(7, "Reference count for user: " + std::to_string(mobile_) +
-                                    ", ID: group.shared is 2"));
+    EXPECT_TRUE(log.contains(
+        7, "Reference count for user: " + std::to_string(mobile_) + ", ID: group.shared is 2"));
     EXPECT_TRUE(log.contains(5, "Last reference to group container group.one for " +
                                     std::to_string(mobile_) + " is going away; removing it."));
     EXPECT_TRUE(stdfs::exists(one.at("group.shared")));
@@ -108,10 +109,10 @@ TEST_F(BTHGroupManagerTest, ReconciliationStagesOnlyUnreferencedGroups) {
     const auto kept = paths(mobile_, "kept.app");
     // A group container no entitlement names (left by an older release).
     uint64_t code = 0;
-    const BTHMetadataRef stray = BTHClientConnection::sharedClientConnection()
-                                     ->createOrLookupContainerForUser(
-                                         mobile_, std::string("group.stray"), true,
-                                         BTHContainerClassSharedAppGroup, false, true, &code);
+    const BTHMetadataRef stray =
+        BTHClientConnection::sharedClientConnection()->createOrLookupContainerForUser(
+            mobile_, std::string("group.stray"), true, BTHContainerClassSharedAppGroup, false, true,
+            &code);
     ASSERT_TRUE(stray) << code;
     test::LogCapture log;
     groups_->reconcileGroupContainersOfType(BTHGroupTypeApplication);
