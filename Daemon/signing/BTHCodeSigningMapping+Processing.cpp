@@ -27,6 +27,10 @@ bool optionIsTrue(const std::optional<Value>& options, const char* key) {
 uint64_t BTHCodeSigningMapping::processCodeSigningInfo(const std::optional<Value>& info,
                                                        const std::optional<std::string>& identifier,
                                                        const std::optional<Value>& options) {
+    // Information that changes nothing (a caller's entitlements, refreshed on
+    // each of its requests) needs neither the lock nor any container work.
+    if (onCodeSignQueue([&] { return isUnchanged(info, identifier, options); }))
+        return BTHErrorSuccess;
     return lockingAll([&] { return onQueueProcessCodeSigningInfo(info, identifier, options); });
 }
 
@@ -66,12 +70,75 @@ void BTHCodeSigningMapping::tellGroupManager(
         hooks_.groupContainerIdsChanged(std::move(oldGroups), newGroups, type);
 }
 
+BTHCodeSigningMapping::PreparedEntry BTHCodeSigningMapping::prepareEntry(
+    const std::optional<Value>& info, const std::string& identifier,
+    const std::optional<Value>& options) const {
+    BTH_FUNCTION(kProcessFunction);
+    PreparedEntry prepared;
+    prepared.entry = std::make_shared<BTHCodeSigningEntry>();
+    BTHCodeSigningEntry& entry = *prepared.entry;
+    const BTHCodeSigningEntry* old = storedEntry(identifier);
+    const Value* dataClass = options ? options->find(kBTHDataContainerClassOption) : nullptr;
+    entry.setDataContainerClass(dataClass ? dataClass->uint64Value().value_or(0) : 0);
+
+    // Children whose entries have gone are dropped from the list.
+    if (old && old->childBundleIdentifiers()) {
+        std::vector<std::string> children = *old->childBundleIdentifiers();
+        std::erase_if(children, [&](const std::string& c) { return !storedEntry(c); });
+        entry.setChildBundleIdentifiers(std::move(children));
+    }
+
+    const Value* parentValue = options ? options->find(kBTHParentBundleIDOption) : nullptr;
+    const std::string* parent = parentValue ? parentValue->string() : nullptr;
+    if (parent && *parent == identifier) {
+        BTHLogError("Ignoring %@ as its own parent", identifier);
+    } else if (parent) {
+        // The parent's entry changes as a copy that is staged, so the new
+        // child list reaches the file with this processing; a parent without
+        // entry stays unknown (its blank entry stores nothing).
+        const BTHCodeSigningEntry* stored = storedEntry(*parent);
+        std::vector<std::string> children = stored && stored->childBundleIdentifiers()
+                                                ? *stored->childBundleIdentifiers()
+                                                : std::vector<std::string>{};
+        if (std::find(children.begin(), children.end(), identifier) == children.end()) {
+            children.push_back(identifier);
+            prepared.parent = stored ? std::make_shared<BTHCodeSigningEntry>(*stored)
+                                     : std::make_shared<BTHCodeSigningEntry>();
+            prepared.parent->setChildBundleIdentifiers(std::move(children));
+            prepared.parentIdentifier = *parent;
+        }
+    }
+
+    if (optionIsTrue(options, kBTHRegByCallerOption)) entry.setRegisteredByCaller(true);
+    if (optionIsTrue(options, kBTHPlaceholderOption)) entry.setPlaceholder(true);
+    entry.setCodeSigningInfo(info);
+    prepared.changed = !old || !(*old == entry);
+    return prepared;
+}
+
+bool BTHCodeSigningMapping::isUnchanged(const std::optional<Value>& info,
+                                        const std::optional<std::string>& identifier,
+                                        const std::optional<Value>& options) const {
+    if (!identifier || !acceptable(info, options)) return false;
+    try {
+        const PreparedEntry prepared = prepareEntry(info, *identifier, options);
+        return !prepared.changed && !prepared.parent;
+    } catch (...) {
+        return false;  // processing proper reports it
+    }
+}
+
+bool BTHCodeSigningMapping::acceptable(const std::optional<Value>& info,
+                                       const std::optional<Value>& options) {
+    return (!info || info->isDictionary()) && (!options || options->isDictionary());
+}
+
 uint64_t BTHCodeSigningMapping::onQueueProcessCodeSigningInfo(
     const std::optional<Value>& info, const std::optional<std::string>& identifier,
     const std::optional<Value>& options) {
     BTH_FUNCTION(kProcessFunction);
     if (!identifier) return BTHErrorIdentifierMissing;
-    if ((info && !info->isDictionary()) || (options && !options->isDictionary())) {
+    if (!acceptable(info, options)) {
         BTHMakeError(BTHErrorInvalidArgument, nullptr,
                      "Can't act on an invalid object: ID: %@, info: %@, options: %@", identifier,
                      info ? kindName(info->kind()) : "(null)",
@@ -82,71 +149,38 @@ uint64_t BTHCodeSigningMapping::onQueueProcessCodeSigningInfo(
     std::vector<BTHCodeSigningEntryRef> staged;
     std::vector<std::string> stagedIdentifiers;
     BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() -> BTHErrorRef {
-        auto entry = std::make_shared<BTHCodeSigningEntry>();
-        const BTHCodeSigningEntry* old = storedEntry(*identifier);
-        const Value* dataClass = options ? options->find(kBTHDataContainerClassOption) : nullptr;
-        entry->setDataContainerClass(dataClass ? dataClass->uint64Value().value_or(0) : 0);
-
-        // Children whose entries have gone are dropped from the list.
-        if (old && old->childBundleIdentifiers()) {
-            std::vector<std::string> children = *old->childBundleIdentifiers();
-            std::erase_if(children, [&](const std::string& c) { return !storedEntry(c); });
-            entry->setChildBundleIdentifiers(std::move(children));
+        PreparedEntry prepared = prepareEntry(info, *identifier, options);
+        if (prepared.parent) {
+            BTHLogDebug("Staging Child Bundles: %@ for parent ID: %@ by appending: %@",
+                        BTHStringListValue(*prepared.parent->childBundleIdentifiers()),
+                        prepared.parentIdentifier, *identifier);
+            staged.push_back(prepared.parent);
+            stagedIdentifiers.push_back(prepared.parentIdentifier);
         }
+        if (!prepared.changed) return nullptr;
 
-        const Value* parentValue = options ? options->find(kBTHParentBundleIDOption) : nullptr;
-        const std::string* parent = parentValue ? parentValue->string() : nullptr;
-        if (parent && *parent == *identifier) {
-            BTHLogError("Ignoring %@ as its own parent", *identifier);
-        } else if (parent) {
-            // The parent's entry changes as a copy that is staged, so the new
-            // child list reaches the file with this processing; a parent
-            // without entry stays unknown (its blank entry stores nothing).
-            const BTHCodeSigningEntry* stored = storedEntry(*parent);
-            auto parentEntry = stored ? std::make_shared<BTHCodeSigningEntry>(*stored)
-                                      : std::make_shared<BTHCodeSigningEntry>();
-            std::vector<std::string> children =
-                parentEntry->childBundleIdentifiers().value_or(std::vector<std::string>{});
-            if (std::find(children.begin(), children.end(), *identifier) == children.end()) {
-                children.push_back(*identifier);
-                BTHLogDebug("Staging Child Bundles: %@ for parent ID: %@ by appending: %@",
-                            BTHStringListValue(children), *parent, *identifier);
-                parentEntry->setChildBundleIdentifiers(std::move(children));
-                staged.push_back(parentEntry);
-                stagedIdentifiers.push_back(*parent);
-            }
-        }
-
-        if (optionIsTrue(options, kBTHRegByCallerOption)) entry->setRegisteredByCaller(true);
-        if (optionIsTrue(options, kBTHPlaceholderOption)) entry->setPlaceholder(true);
-        entry->setCodeSigningInfo(info);
-
-        if (!old || !(*old == *entry)) {
-            const Value* entitlements = info ? info->find(kBTHEntitlementsKey) : nullptr;
-            if (entitlements && !entitlements->isDictionary()) entitlements = nullptr;
-            // Every read of the stored state below sees the old entry.
-            const Value* oldEntitlements = onQueueEntitlementsForIdentifier(*identifier);
-            if (oldEntitlements &&
-                BTHTruthValue(oldEntitlements->find(kBTHSystemContainerEntitlement)) &&
-                !(entitlements &&
-                  BTHTruthValue(entitlements->find(kBTHSystemContainerEntitlement))))
-                withdrawSystemContainer(*identifier);
-            BTHCrashPoint("codesign.before-groups");
-            tellGroupManager(BTHGroupListOfEntitlements(*identifier, oldEntitlements,
-                                                        kBTHApplicationGroupsEntitlement, nullptr),
-                             BTHGroupListOfEntitlements(*identifier, entitlements,
-                                                        kBTHApplicationGroupsEntitlement, nullptr),
-                             BTHGroupTypeApplication);
-            tellGroupManager(
-                onQueueSystemGroupIdentifiers(*identifier),
-                BTHGroupListOfEntitlements(*identifier, entitlements, kBTHSystemGroupsEntitlement,
-                                           kBTHSystemGroupContainersEntitlement),
-                BTHGroupTypeSystem);
-            BTHCrashPoint("codesign.after-groups");
-            if (!info) entry = std::make_shared<BTHCodeSigningEntry>();
-            staged.push_back(entry);
-            stagedIdentifiers.push_back(*identifier);
-        }
+        const Value* entitlements = info ? info->find(kBTHEntitlementsKey) : nullptr;
+        if (entitlements && !entitlements->isDictionary()) entitlements = nullptr;
+        // Every read of the stored state below sees the old entry.
+        const Value* oldEntitlements = onQueueEntitlementsForIdentifier(*identifier);
+        if (oldEntitlements &&
+            BTHTruthValue(oldEntitlements->find(kBTHSystemContainerEntitlement)) &&
+            !(entitlements && BTHTruthValue(entitlements->find(kBTHSystemContainerEntitlement))))
+            withdrawSystemContainer(*identifier);
+        BTHCrashPoint("codesign.before-groups");
+        tellGroupManager(BTHGroupListOfEntitlements(*identifier, oldEntitlements,
+                                                    kBTHApplicationGroupsEntitlement, nullptr),
+                         BTHGroupListOfEntitlements(*identifier, entitlements,
+                                                    kBTHApplicationGroupsEntitlement, nullptr),
+                         BTHGroupTypeApplication);
+        tellGroupManager(
+            onQueueSystemGroupIdentifiers(*identifier),
+            BTHGroupListOfEntitlements(*identifier, entitlements, kBTHSystemGroupsEntitlement,
+                                       kBTHSystemGroupContainersEntitlement),
+            BTHGroupTypeSystem);
+        BTHCrashPoint("codesign.after-groups");
+        staged.push_back(info ? prepared.entry : std::make_shared<BTHCodeSigningEntry>());
+        stagedIdentifiers.push_back(*identifier);
         return nullptr;
     });
     if (failure) return failure->code64();

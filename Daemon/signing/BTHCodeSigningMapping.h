@@ -8,6 +8,11 @@
 // under the all-identifiers lock held for writing. The store itself has no
 // lock.
 //
+// Processing, queries, removal and invalidation are the modules
+// BTHCodeSigningMapping+Processing.cpp, +Queries.cpp and +Removal.cpp; what a
+// change implies above the store (the all-identifiers lock, system
+// containers, group containers) reaches it through BTHCodeSigningHooks.
+//
 // A missing file is an empty store (created on the first change). A file
 // that cannot be read or is not a dictionary leaves the process without a
 // store: sharedInstance() is then null for the life of the process and the
@@ -217,6 +222,19 @@ class BTHCodeSigningMapping {
     const Value* onQueueEntitlementsForIdentifier(const std::string& identifier);
     std::optional<std::vector<std::string>> onQueueSystemGroupIdentifiers(
         const std::string& identifier);
+    // Processing's new entry for `identifier`, and the parent's entry with
+    // the identifier added to its children when that changes it.
+    struct PreparedEntry {
+        BTHCodeSigningEntryRef entry;
+        bool changed = false;  // the entry differs from the stored one
+        BTHCodeSigningEntryRef parent;
+        std::string parentIdentifier;
+    };
+    PreparedEntry prepareEntry(const std::optional<Value>& info, const std::string& identifier,
+                               const std::optional<Value>& options) const;
+    bool isUnchanged(const std::optional<Value>& info, const std::optional<std::string>& identifier,
+                     const std::optional<Value>& options) const;
+    static bool acceptable(const std::optional<Value>& info, const std::optional<Value>& options);
     uint64_t onQueueProcessCodeSigningInfo(const std::optional<Value>& info,
                                            const std::optional<std::string>& identifier,
                                            const std::optional<Value>& options);
