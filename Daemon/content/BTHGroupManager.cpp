@@ -30,15 +30,20 @@ GroupKeys keysOfType(BTHGroupType type) {
     return {kBTHApplicationGroupsEntitlement, nullptr};
 }
 
-// Stages one group container for deletion without identifier locking; the
-// code of the staging.
-uint64_t stageForDelete(uid_t userId, const BTHMetadata& container) {
+// Stages one container for deletion without identifier locking (the caller
+// holds the all-identifiers lock); the code of the staging.
+uint64_t stageForDelete(uid_t userId, const Uuid& uuid, const std::string& identifier,
+                        uint64_t containerClass) {
     uint64_t code = BTHErrorSuccess;
     BTHClientConnection::sharedClientConnection()->stageForDeleteContainersWithUsers(
-        {userId}, {container.uuid()},
-        std::vector<std::optional<std::string>>{container.identifier()},
-        {Value(container.containerClass())}, false, &code);
+        {userId}, {uuid}, std::vector<std::optional<std::string>>{identifier},
+        {Value(containerClass)}, false, &code);
     return code;
+}
+
+uint64_t stageForDelete(uid_t userId, const BTHMetadata& container) {
+    return stageForDelete(userId, container.uuid(), container.identifier(),
+                          container.containerClass());
 }
 
 }  // namespace
@@ -255,11 +260,7 @@ BTHCodeSigningHooks BTHMakeCodeSigningHooks(BTHGroupManager& groups) {
     };
     hooks.stageForDelete = [](uid_t user, const Uuid& uuid, const std::string& identifier,
                               uint64_t containerClass) {
-        uint64_t code = BTHErrorSuccess;
-        BTHClientConnection::sharedClientConnection()->stageForDeleteContainersWithUsers(
-            {user}, {uuid}, std::vector<std::optional<std::string>>{identifier},
-            {Value(containerClass)}, false, &code);
-        return code;
+        return stageForDelete(user, uuid, identifier, containerClass);
     };
     hooks.groupContainerIdsChanged =
         [&groups](std::optional<std::vector<std::string>> oldIds,

@@ -77,8 +77,9 @@ uint64_t BTHCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleCon
     BTHErrorRef writeError = lockingAll([&] {
         BTHContainerCache& cache = BTHContainerCache::sharedInstance();
         std::vector<std::string> orphans;
-        for (const auto& [identifier, entry] : codeSigningMappingDict_) {
-            if (entry->isRegisteredByCaller()) continue;
+        for (const auto& stored : codeSigningMappingDict_) {
+            const std::string& identifier = stored.first;
+            if (stored.second->isRegisteredByCaller()) continue;
             const bool hasBundle = std::any_of(
                 std::begin(kBundleClasses), std::end(kBundleClasses), [&](uint64_t bundleClass) {
                     return cache.containerForUser(kBTHBundleUserId, bundleClass, identifier, false,
