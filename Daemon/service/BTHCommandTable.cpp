@@ -1,7 +1,9 @@
 #include "BTHCommandTable.h"
 
+#include "BTHCodeSigningCommands.h"
 #include "BTHContainerCommands.h"
 #include "BTHError.h"
+#include "BTHGroupCommands.h"
 #include "BTHProtectionCommands.h"
 #include "BTHUsageCommands.h"
 
@@ -35,6 +37,14 @@ constexpr struct {
     {10, deleteContainer},
     {11, wipePluginDataContainer},
     {12, wipeDataContainer},
+    {13, groupContainerPaths},
+    {14, groupContainerIdentifiers},
+    {15, systemContainerPath},
+    {16, systemGroupContainerPaths},
+    {17, systemGroupContainerPath},
+    {18, processCodeSigningInfo},
+    {19, getCodeSigningInfo},
+    {20, invalidateCodeSigningInfo},
     {21, setDataProtection},
     {22, recreateDefaultStructure},
     {23, diskUsage},

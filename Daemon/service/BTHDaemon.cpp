@@ -16,8 +16,10 @@
 #include "BTHApplicationTerminationAssertion.h"
 #include "BTHAsyncWork.h"
 #include "BTHClientConnection.h"
+#include "BTHCodeSigningMapping.h"
 #include "BTHError.h"
 #include "BTHGlobalConfiguration.h"
+#include "BTHGroupManager.h"
 #include "BTHLockStateCallback.h"
 #include "BTHLog.h"
 #include "BTHRelayRequest.h"
@@ -149,6 +151,14 @@ std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& l
     return listener;
 }
 
+// What a change of entitlements implies above the code-signing store: the
+// all-identifiers lock around processing, staging a withdrawn system
+// container, re-counting groups. Connected before the first request.
+void connectCodeSigningConsequences() {
+    if (BTHCodeSigningMapping* mapping = BTHCodeSigningMapping::sharedInstance())
+        mapping->setHooks(BTHMakeCodeSigningHooks(BTHGroupManager::defaultManager()));
+}
+
 }  // namespace
 
 uint32_t BTHLogFileCount() {
@@ -175,6 +185,7 @@ int BTHDaemonMain() {
     }
     BTHDeathRowQueue()->setTarget(WorkQueue::global(QueuePriority::background));
     BTHClientConnection::sharedClientConnection();
+    connectCodeSigningConsequences();
 
     const bool firstBoot = !NamedSemaphore::exists(kBTHFirstBootSemaphoreName);
     if (firstBoot) {

@@ -1,5 +1,6 @@
 #include "BTHRequestIntake.h"
 
+#include "BTHCodeSigningMapping.h"
 #include "BTHCommandTable.h"
 #include "BTHError.h"
 #include "BTHGlobalConfiguration.h"
@@ -31,6 +32,22 @@ std::string servedIdentifier(const Value& message, const BTHPeerIdentity& peer) 
     if (const Value* named = message.find("Identifier"); named && named->string())
         return *named->string();
     return peer.signingIdentifier.value_or("");
+}
+
+// A caller's own entitlements stand for its code-signing information until
+// the installer reports some: registered when the identifier has none, and
+// refreshed on every request while they are the caller's own. The request
+// goes on whatever the outcome.
+void refreshCallerRegisteredEntitlements(const std::string& identifier, const Value& entitlements) {
+    BTH_FUNCTION("checkEntitlementsAndInitClientObject");
+    BTHCodeSigningMapping* mapping = BTHCodeSigningMapping::sharedInstance();
+    if (!mapping) return;
+    if (!mapping->identifierHasCallerRegisteredEntitlements(identifier) &&
+        mapping->codeSigningInfoExistForIdentifier(identifier))
+        return;
+    const uint64_t code = mapping->processCallerRegisteredEntitlements(entitlements, identifier);
+    if (code != BTHErrorSuccess)
+        BTHLogError("Error processing entitlements for %@ : %llu", identifier, code);
 }
 
 }  // namespace
@@ -73,8 +90,8 @@ std::shared_ptr<BTHClientConnection> checkEntitlementsAndInitClientObject(
         return refuse(peer, requiredEntitlement);
     }
 
-    // Caller-registered entitlements are refreshed here once the code-signing
-    // store processes them; until then the request goes on as it is.
+    if (peer.signingIdentifier)
+        refreshCallerRegisteredEntitlements(*peer.signingIdentifier, entitlements);
 
     return std::make_shared<BTHClientConnection>(peer.signingIdentifier, peer.effectiveUserId,
                                                  allowOtherIdLookup, std::move(wipeIdentifiers));

@@ -130,27 +130,4 @@ const BTHCodeSigningEntry* BTHCodeSigningMapping::storedEntry(const std::string&
     return stored == codeSigningMappingDict_.end() ? nullptr : stored->second.get();
 }
 
-bool BTHCodeSigningMapping::identifierHasSystemContainer(const std::string& identifier) {
-    return onCodeSignQueue([&] {
-        const BTHCodeSigningEntry* entry = storedEntry(identifier);
-        const Value* entitlements = entry ? entry->entitlements() : nullptr;
-        return entitlements && BTHTruthValue(entitlements->find(kBTHSystemContainerEntitlement));
-    });
-}
-
-uint64_t BTHCodeSigningMapping::dataContainerTypeForIdentifier(const std::string& identifier) {
-    return onCodeSignQueue([&] {
-        const BTHCodeSigningEntry* entry = storedEntry(identifier);
-        return entry ? entry->dataContainerClass() : uint64_t{0};
-    });
-}
-
-bool BTHCodeSigningMapping::identifierHasCallerRegisteredEntitlements(
-    const std::string& identifier) {
-    return onCodeSignQueue([&] {
-        const BTHCodeSigningEntry* entry = storedEntry(identifier);
-        return entry && entry->isRegisteredByCaller();
-    });
-}
-
 }  // namespace berth

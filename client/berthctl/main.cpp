@@ -11,10 +11,12 @@
 #include <string_view>
 #include <vector>
 
+#include "CodeSigningCommands.h"
 #include "CommandsListing.h"
 #include "Completion.h"
 #include "ContainerCommands.h"
 #include "ExitStatus.h"
+#include "GroupCommands.h"
 #include "LockCommand.h"
 #include "SendCommand.h"
 #include "SignCommand.h"
@@ -36,6 +38,8 @@ struct Arguments {
     uint32_t user = 1;
     UpcallOptions upcall;
     UsageOptions usage;
+    GroupOptions group;
+    CodeSigningCommandOptions codeSigning;
 };
 
 std::chrono::milliseconds timeoutOf(double seconds) {
@@ -201,6 +205,52 @@ CLI::App* addUsageCommand(CLI::App& app, UsageOptions::Action action, Arguments&
     return command;
 }
 
+// Adds a group subcommand that runs `action`.
+CLI::App* addGroupCommand(CLI::App& parent, const char* name, const char* description,
+                          GroupAction action, Arguments& args) {
+    CLI::App* command = parent.add_subcommand(name, description);
+    command->callback([&args, action] { args.group.action = action; });
+    addIdentifierOption(command, "--identifier", "Identifier (default: your own)",
+                        args.group.identifier);
+    if (action == GroupAction::Groups || action == GroupAction::GroupIdentifiers)
+        command->add_option("--user", args.group.user, "User id; 1 (default) is your own user");
+    if (action == GroupAction::SystemGroup)
+        command->add_option("group", args.group.group, "The system group identifier")->required();
+    addConnectionOptions(command, args);
+    return command;
+}
+
+// Adds "codesign" with its three subcommands.
+CLI::App* addCodeSigningCommands(CLI::App& app, Arguments& args) {
+    CLI::App* codesign = app.add_subcommand("codesign", "Record or read code-signing information");
+    codesign->require_subcommand(1);
+    CodeSigningCommandOptions& options = args.codeSigning;
+    CLI::App* process = codesign->add_subcommand(
+        "process", "Record an identifier's code-signing information (none: remove it)");
+    process->callback([&options] { options.action = CodeSigningAction::Process; });
+    process->add_option("identifier", options.identifier, "The identifier")->required();
+    process->add_option("--info", options.info, "The information as a typed JSON dictionary");
+    process->add_flag("--entitlements", options.entitlements, "--info holds only the entitlements");
+    process->add_option_function<uint64_t>(
+        "--data-class", [&options](uint64_t c) { options.dataContainerClass = c; },
+        "The identifier's data container class");
+    process->add_option_function<std::string>(
+        "--parent", [&options](const std::string& p) { options.parent = p; },
+        "The identifier is a child of this one");
+    process->add_flag("--placeholder", options.placeholder, "Placeholder entitlements");
+    addConnectionOptions(process, args);
+    CLI::App* get =
+        codesign->add_subcommand("get", "Print an identifier's code-signing information");
+    get->callback([&options] { options.action = CodeSigningAction::Get; });
+    get->add_option("identifier", options.identifier, "The identifier")->required();
+    addConnectionOptions(get, args);
+    CLI::App* invalidate = codesign->add_subcommand(
+        "invalidate", "Invalidate the information of identifiers without bundle container");
+    invalidate->callback([&options] { options.action = CodeSigningAction::Invalidate; });
+    addConnectionOptions(invalidate, args);
+    return codesign;
+}
+
 // Checks what CLI11 cannot: which positionals the chosen sign action needs.
 void validateSign(Arguments& args) {
     if (args.signRemove && args.signList)
@@ -313,6 +363,26 @@ int main(int argc, char** argv) {
     for (const auto& removal : removals)
         containerCommands.push_back(
             addContainerCommand(app, removal.name, removal.description, removal.action, args));
+    const struct {
+        const char* name;
+        const char* description;
+        GroupAction action;
+    } groupActions[] = {
+        {"groups", "Print the paths of an identifier's app-group containers (made on demand)",
+         GroupAction::Groups},
+        {"group-identifiers", "Print an identifier's app-group identifiers",
+         GroupAction::GroupIdentifiers},
+        {"system-container", "Print the path of an identifier's system container",
+         GroupAction::SystemContainer},
+        {"system-groups", "Print the paths of an identifier's system-group containers",
+         GroupAction::SystemGroups},
+        {"system-group", "Print the path of one system-group container", GroupAction::SystemGroup},
+    };
+    std::vector<CLI::App*> groupCommands;
+    for (const auto& action : groupActions)
+        groupCommands.push_back(
+            addGroupCommand(app, action.name, action.description, action.action, args));
+    CLI::App* codesign = addCodeSigningCommands(app, args);
 
     // Asked by the shells' completion scripts; never shown in the help.
     if (argc >= 2 && std::string_view(argv[1]) == "__complete")
@@ -344,6 +414,19 @@ int main(int argc, char** argv) {
         args.usage.socket = args.send.socket;
         args.usage.timeout = timeoutOf(args.timeoutSeconds);
         return runUsageCommand(args.usage, std::cout, std::cerr);
+    }
+    for (CLI::App* command : groupCommands) {
+        if (!command->parsed()) continue;
+        args.group.json = args.json;
+        args.group.socket = args.send.socket;
+        args.group.timeout = timeoutOf(args.timeoutSeconds);
+        return runGroupCommand(args.group, std::cout, std::cerr);
+    }
+    if (codesign->parsed()) {
+        args.codeSigning.json = args.json;
+        args.codeSigning.socket = args.send.socket;
+        args.codeSigning.timeout = timeoutOf(args.timeoutSeconds);
+        return runCodeSigningCommand(args.codeSigning, std::cout, std::cerr);
     }
     if (sign->parsed()) {
         args.sign.json = args.json;

@@ -247,3 +247,46 @@ TEST_F(BerthctlContainersDaemonTest, RemovalAndReplace) {
 
 }  // namespace
 }  // namespace berth
+
+namespace berth {
+namespace {
+
+// The group and code-signing subcommands: what the installer records decides
+// which groups an identifier gets.
+TEST_F(BerthctlContainersDaemonTest, GroupsFollowRecordedCodeSigningInformation) {
+    const Outcome recorded =
+        berthctl({"codesign", "process", "com.example.grouped", "--entitlements", "--data-class",
+                  "2", "--info", R"({"sys.kelp.security.application-groups": ["group.ctl"]})"});
+    ASSERT_EQ(recorded.status, 0) << recorded.err;
+    const Value info = printed(berthctl({"--json", "codesign", "get", "com.example.grouped"}));
+    EXPECT_EQ(
+        *info.find("sys.kelp.Berth.Entitlements")->find("sys.kelp.security.application-groups"),
+        Value(Value::Array{"group.ctl"}));
+
+    const Value paths =
+        printed(berthctl({"--json", "groups", "--identifier", "com.example.grouped"}));
+    const fs::path group = text(paths, "group.ctl");
+    EXPECT_TRUE(fs::is_directory(group)) << paths.description();
+    const Outcome identifiers =
+        berthctl({"group-identifiers", "--identifier", "com.example.grouped"});
+    EXPECT_EQ(identifiers.out, "group.ctl\n");
+
+    const Outcome refused = berthctl({"system-group", "systemgroup.sys.kelp.ctl.other"});
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_NE(refused.err.find("BTHErrorNotEntitled (55)"), std::string::npos) << refused.err;
+    const Outcome wellKnown = berthctl({"system-container", "--identifier", "sys.kelp.quarryd"});
+    EXPECT_EQ(fs::path(wellKnown.out.substr(0, wellKnown.out.size() - 1)).filename(),
+              "sys.kelp.quarryd");
+
+    // Removing the information removes its only reference to the group.
+    EXPECT_EQ(berthctl({"codesign", "process", "com.example.grouped"}).status, 0);
+    EXPECT_FALSE(fs::exists(group));
+    const Outcome gone = berthctl({"codesign", "get", "com.example.grouped"});
+    EXPECT_EQ(gone.status, 1);
+    EXPECT_NE(gone.err.find("BTHErrorNotFound (21)"), std::string::npos) << gone.err;
+    EXPECT_EQ(berthctl({"codesign", "invalidate"}).status, 0);
+    EXPECT_EQ(berthctl({"codesign", "process", "x", "--info", "[1]"}).status, 64);
+}
+
+}  // namespace
+}  // namespace berth

@@ -52,10 +52,18 @@ Value command(uint64_t n) {
 // Commands that pass the entitlement check reach their handler; refused ones
 // get 55. Sent without keys, a handler that validates the user answers 38,
 // staging nothing succeeds, and one not built into this daemon yet answers
-// 49.
-uint64_t reachedHandler(uint64_t command) {
-    if (command == 3) return BTHErrorSuccess;
-    for (uint64_t validating : {0, 1, 2, 5, 6, 7, 8, 9, 10, 11, 12, 21, 22, 23})
+// 49. Of the group and code-signing commands, the caller's own system
+// container and a missing system group are not its (55), it has no system
+// groups (1, none), processing needs an identifier (18), getting finds
+// nothing (21) and invalidating succeeds. A caller that may look up others
+// gets any system container.
+uint64_t reachedHandler(uint64_t command, bool mayLookUpOthers = false) {
+    if (command == 3 || command == 16 || command == 20) return BTHErrorSuccess;
+    if (command == 15) return mayLookUpOthers ? BTHErrorSuccess : BTHErrorNotEntitled;
+    if (command == 17) return BTHErrorNotEntitled;
+    if (command == 18) return BTHErrorIdentifierMissing;
+    if (command == 19) return BTHErrorNotFound;
+    for (uint64_t validating : {0, 1, 2, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 21, 22, 23})
         if (command == validating) return BTHErrorInvalidParameter;
     return BTHErrorInvalidCommand;
 }
@@ -78,7 +86,7 @@ TEST(BTHRequestIntakeTest, AllowedPassesEveryCommandAndOtherIdLookupOnlyTheOpenO
     const auto allowed = peerWith(dict({{kBTHEntitlementAllowed, true}}));
     for (uint64_t c = 0; c < kBTHCommandCount; ++c) {
         if (c == 4) continue;  // replies later, from its completion (below)
-        EXPECT_EQ(run(command(c), allowed).first, reachedHandler(c)) << c;
+        EXPECT_EQ(run(command(c), allowed).first, reachedHandler(c, true)) << c;
     }
 
     const auto lookupOnly = peerWith(dict({{kBTHEntitlementOtherIdLookup, true}}));
