@@ -50,7 +50,10 @@ int main(int argc, char** argv) {
     std::string root;
     CLI::App app{
         "berth-launch: start a program as an application, in a sandbox that sees only its "
-        "containers, as the persona's user (root only)"};
+        "containers, as the persona's user (root only)",
+        "berth-launch"};
+    app.footer(
+        "The program and its arguments follow \"--\": berth-launch [OPTIONS] -- PROGRAM [ARGS...]");
     app.add_option("--identifier", request.signingIdentifier, "The application's identifier")
         ->required();
     app.add_option("--persona", request.persona, "The user to run as and whose containers")

@@ -32,6 +32,14 @@ check_units() {
     [[ $(grep '^ExecStart=' "$units/berthd.service") == "ExecStart=/usr/libexec/berthd" ]] ||
         fail "the unit does not start the installed daemon: $(grep '^ExecStart=' "$units/berthd.service")"
     [[ -x $scratch/stage/usr/libexec/berthd ]] || fail "no installed daemon"
+    for program in berthctl berth-launch; do
+        [[ -x $scratch/stage/usr/bin/$program ]] || fail "no installed $program"
+    done
+    if command -v scdoc >/dev/null; then
+        for page in man8/berthd.8 man1/berthctl.1 man1/berth-launch.1; do
+            [[ -s $scratch/stage/usr/share/man/$page ]] || fail "no manual page $page"
+        done
+    fi
     # The units they depend on (sysinit.target, ...) come from this system.
     local root=$scratch/verify
     mkdir -p "$root/usr/lib/systemd/system"
@@ -65,7 +73,8 @@ check_completion() {
     got=$(complete_words berthctl cre)
     [[ $got == create ]] || fail "'berthctl cre' offers: $got"
     got=$(complete_words berthctl "")
-    for sub in send create lookup list delete wipe sign lock unlock commands; do
+    for sub in send create lookup list delete wipe sign lock unlock commands groups system-container \
+        codesign usage protect upcall; do
         grep -qx "$sub" <<<"$got" || fail "'berthctl ' does not offer $sub: $got"
     done
     grep -q '__complete' <<<"$got" && fail "the completion offers its own hidden verb"
@@ -122,7 +131,7 @@ check_package() {
     deb=$(ls -t "$build"/package/berthd_*.deb | head -n 1)
     local depends
     depends=$(dpkg-deb -f "$deb" Depends)
-    for dep in libacl1 libssl3 libsystemd0 systemd; do
+    for dep in libacl1 libssl3 libsystemd0 systemd bubblewrap; do
         grep -q "$dep" <<<"$depends" || fail "the package does not depend on $dep: $depends"
     done
 
