@@ -13,6 +13,10 @@ namespace {
 // at again before it counts as unreadable.
 constexpr int kAttemptsPerItem = 4;
 
+// How many of the innermost directories are kept open (two descriptors
+// each); the walk's descriptors stay bounded whatever the depth of the tree.
+constexpr size_t kOpenDirectories = 32;
+
 WalkEntry::Kind kindOf(const struct stat& st) {
     if (S_ISDIR(st.st_mode)) return WalkEntry::Kind::DirectoryPre;
     if (S_ISREG(st.st_mode)) return WalkEntry::Kind::File;
@@ -22,13 +26,66 @@ WalkEntry::Kind kindOf(const struct stat& st) {
 
 }  // namespace
 
+// A directory being walked. While it is among the innermost directories it
+// is open and read as it goes; deeper in the tree it is parked: its
+// remaining names are read in advance and it is closed, and it is opened
+// again through its child's ".." (and checked to be the same directory) when
+// the walk comes back to it.
 struct TreeWalk::Frame {
     UniqueFd dir;
-    DirReader reader;
-    WalkEntry entry;  // the directory's own entry, for its post-order visit
+    std::optional<DirReader> reader;
+    std::vector<std::string> parked;  // the names still to visit, once parked
+    size_t nextParked = 0;
+    int parkedError = 0;  // why reading ahead stopped short, reported in turn
+    WalkEntry entry;      // the directory's own entry, for its post-order visit
 
-    Frame(UniqueFd fd, WalkEntry e) : dir(std::move(fd)), reader(dir.get()), entry(std::move(e)) {
+    Frame(UniqueFd fd, WalkEntry e) : dir(std::move(fd)), entry(std::move(e)) {
+        reader.emplace(dir.get());
         entry.fd = dir.get();
+    }
+
+    bool isOpen() const { return static_cast<bool>(dir); }
+
+    // Reads the rest of the directory (unless done before) and closes it.
+    void park() {
+        if (reader) {
+            errno = 0;
+            while (const struct dirent* d = reader->next()) parked.emplace_back(d->d_name);
+            parkedError = errno;
+            reader.reset();
+        }
+        dir.reset();
+        entry.fd = -1;
+    }
+
+    // Opens the parked directory again as the parent of `child`; false when
+    // that is no longer the directory that was parked.
+    bool unpark(int child) {
+        UniqueFd parent(::openat(child, "..", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        struct stat st;
+        if (!parent || ::fstat(parent.get(), &st) != 0) return false;
+        if (!sameItem(st, entry.st)) {
+            errno = ESTALE;
+            return false;
+        }
+        dir = std::move(parent);
+        entry.fd = dir.get();
+        return true;
+    }
+
+    // The next name, or false at the end (errno 0) or on a read error.
+    bool nextName(std::string* name) {
+        if (reader) {
+            const struct dirent* d = reader->next();
+            if (d) *name = d->d_name;
+            return d != nullptr;
+        }
+        if (nextParked < parked.size()) {
+            *name = std::move(parked[nextParked++]);
+            return true;
+        }
+        errno = parkedError;
+        return false;
     }
 };
 
@@ -68,16 +125,20 @@ const WalkEntry* TreeWalk::next() {
     }
     while (!stack_.empty()) {
         Frame& top = *stack_.back();
-        if (const struct dirent* d = top.reader.next()) {
-            const std::string name = d->d_name;
-            const int parentFd = top.dir.get();
+        std::string name;
+        if (top.nextName(&name)) {
             const std::filesystem::path path = top.entry.path / name;
-            return visit(parentFd, name, path, top.entry.level + 1);
+            return visit(top.dir.get(), name, path, top.entry.level + 1);
         }
         if (errno != 0) return stop(errno, top.entry.path);
         finished_ = std::move(stack_.back());
         stack_.pop_back();
+        if (!stack_.empty() && !stack_.back()->isOpen() &&
+            !stack_.back()->unpark(finished_->dir.get()))
+            return stop(errno, stack_.back()->entry.path);
         current_ = finished_->entry;
+        // The parent may have been parked and opened again since.
+        current_.parentFd = stack_.empty() ? rootParent_.get() : stack_.back()->dir.get();
         current_.kind = WalkEntry::Kind::DirectoryPost;
         return &current_;
     }
@@ -117,12 +178,14 @@ const WalkEntry* TreeWalk::visit(int parentFd, const std::string& name,
         UniqueFd dir = openDirectoryChecked(parentFd, name.c_str(), entry.st);
         if (dir) {
             stack_.push_back(std::make_unique<Frame>(std::move(dir), entry));
-            if (!stack_.back()->reader.valid()) {
+            if (!stack_.back()->reader->valid()) {
                 const int err = errno;
                 stack_.pop_back();
                 entry.errnum = err;
                 break;
             }
+            if (stack_.size() > kOpenDirectories)
+                stack_[stack_.size() - 1 - kOpenDirectories]->park();
             current_ = stack_.back()->entry;
             return &current_;
         }

@@ -5,6 +5,12 @@
 // lstat described. Every entry carries the descriptor of the directory
 // holding it and its name there, so whoever acts on an entry does so without
 // resolving its path again.
+//
+// The walk holds a bounded number of descriptors whatever the depth: only the
+// innermost directories stay open; one further up is read ahead and closed,
+// and on the way back reached again as its child's "..", which must be the
+// very directory left (a directory moved meanwhile ends the walk with
+// ESTALE rather than lead it somewhere else).
 #pragma once
 
 #include <sys/stat.h>

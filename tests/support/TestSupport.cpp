@@ -155,6 +155,36 @@ std::set<std::string> namesIn(const std::filesystem::path& directory) {
     return names;
 }
 
+void makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery) {
+    UniqueFd level(::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    for (int i = 0; i < depth; ++i) {
+        ASSERT_TRUE(level) << "level " << i << ": " << std::strerror(errno);
+        ASSERT_EQ(::mkdirat(level.get(), "d", 0755), 0) << std::strerror(errno);
+        if (fileEvery > 0 && i % fileEvery == 0)
+            UniqueFd(::openat(level.get(), "f", O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+        level = UniqueFd(::openat(level.get(), "d", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    }
+    ASSERT_TRUE(level);
+}
+
+int openDescriptorCount() {
+    int count = 0;
+    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator("/proc/self/fd"))
+        ++count;
+    return count;
+}
+
+DescriptorLimit::DescriptorLimit(rlim_t limit) {
+    ::getrlimit(RLIMIT_NOFILE, &saved_);
+    struct rlimit lowered = saved_;
+    lowered.rlim_cur = limit;
+    EXPECT_EQ(::setrlimit(RLIMIT_NOFILE, &lowered), 0) << std::strerror(errno);
+}
+
+DescriptorLimit::~DescriptorLimit() {
+    ::setrlimit(RLIMIT_NOFILE, &saved_);
+}
+
 void expectPOSIXError(const BTHErrorRef& error, int code, const std::string& description,
                       const std::string& function) {
     ASSERT_TRUE(error) << "no error, expected errno " << code;

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -87,6 +88,26 @@ UniqueFd connectUnix(const std::filesystem::path& path, int type = SOCK_STREAM);
 struct stat lstatOf(const std::filesystem::path& path);
 // The names in a directory.
 std::set<std::string> namesIn(const std::filesystem::path& directory);
+
+// Builds `depth` nested directories named "d" below the existing `top`, with
+// a file "f" in every `fileEvery`-th level (0: none), without ever holding a
+// path longer than one name: the chain may be deeper than any path allows.
+void makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery = 0);
+
+// How many descriptors this process has open.
+int openDescriptorCount();
+
+// Lowers this process's descriptor limit for the scope's life.
+class DescriptorLimit {
+  public:
+    explicit DescriptorLimit(rlim_t limit);
+    ~DescriptorLimit();
+    DescriptorLimit(const DescriptorLimit&) = delete;
+    DescriptorLimit& operator=(const DescriptorLimit&) = delete;
+
+  private:
+    struct rlimit saved_ {};
+};
 
 inline BTHFileManager& manager() {
     return BTHFileManager::defaultManager();

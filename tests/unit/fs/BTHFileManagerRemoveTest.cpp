@@ -212,25 +212,13 @@ TEST(BTHFileManagerRemove, ChainsDeeperThanAnyPathAreRemovedWithFewDescriptors) 
     ScratchDir dir;
     const stdfs::path tree = dir / "deep";
     stdfs::create_directories(tree);
-    {
-        UniqueFd level(::open(tree.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        for (int i = 0; i < 3000 && level; ++i) {
-            ASSERT_EQ(::mkdirat(level.get(), "d", 0755), 0);
-            if (i % 500 == 0) {
-                UniqueFd file(::openat(level.get(), "f", O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
-            }
-            level = UniqueFd(::openat(level.get(), "d", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-        }
-        ASSERT_TRUE(level);
-    }
-    struct rlimit saved {};
-    ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &saved), 0);
-    struct rlimit tight = saved;
-    tight.rlim_cur = 200;
-    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
+    makeDirectoryChain(tree, 3000, 500);
     BTHErrorRef error;
-    const bool removed = manager().removeItemAtURL(tree, &error);
-    ::setrlimit(RLIMIT_NOFILE, &saved);
+    bool removed = false;
+    {
+        DescriptorLimit tight(200);
+        removed = manager().removeItemAtURL(tree, &error);
+    }
     EXPECT_TRUE(removed) << (error ? error->description() : "");
     EXPECT_FALSE(lexists(tree));
 }

@@ -168,5 +168,71 @@ TEST(BTHFileManagerWalk, AnUnreadableDirectoryIsDeliveredAndTheWalkGoesOn) {
     EXPECT_EQ(status, 0);
 }
 
+// An app can nest its directories deeper than the daemon has descriptors:
+// the walk still delivers every item, each with descriptors that lead to
+// it, and holds only a bounded number of descriptors at any depth.
+TEST(BTHFileManagerWalk, ChainsDeeperThanTheDescriptorLimitAreWalkedWithFewDescriptors) {
+    ScratchDir dir;
+    const stdfs::path tree = dir / "deep";
+    stdfs::create_directories(tree);
+    constexpr int kDepth = 1500;  // an unbounded walk would need 3,000 descriptors
+    makeDirectoryChain(tree, kDepth, 500);
+
+    const int idle = openDescriptorCount();
+    int most = idle, pre = 0, post = 0, files = 0, deepest = 0, misplaced = 0;
+    BTHErrorRef error;
+    bool ok = false;
+    {
+        DescriptorLimit tight(200);
+        ok = manager().traverseDirectory(tree, &error, [&](const BTHWalkEntry& e, BTHErrorRef*) {
+            struct stat st {};
+            // What the entry hands over must be the item itself.
+            if (::fstatat(e.parentFd, e.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 ||
+                !fs::sameItem(st, e.st))
+                ++misplaced;
+            if (e.fd >= 0 && (::fstat(e.fd, &st) != 0 || !fs::sameItem(st, e.st))) ++misplaced;
+            pre += e.kind == Kind::DirectoryPre;
+            post += e.kind == Kind::DirectoryPost;
+            files += e.kind == Kind::File;
+            deepest = std::max(deepest, e.level);
+            if (e.level % 250 == 0) most = std::max(most, openDescriptorCount());
+            return true;
+        });
+    }
+    EXPECT_TRUE(ok) << (error ? error->description() : "");
+    EXPECT_EQ(pre, kDepth + 1);
+    EXPECT_EQ(post, kDepth + 1);
+    EXPECT_EQ(files, kDepth / 500);
+    EXPECT_EQ(deepest, kDepth);
+    EXPECT_EQ(misplaced, 0);
+    EXPECT_LT(most - idle, 100) << "descriptors held at depth";
+}
+
+// Coming back up through directories it no longer holds open, the walk
+// reaches each again through its child; a child moved elsewhere meanwhile
+// leads to another directory, and the walk ends instead of going on there.
+TEST(BTHFileManagerWalk, ADirectoryMovedAwayBelowTheOpenOnesEndsTheWalk) {
+    ScratchDir dir;
+    const stdfs::path tree = dir / "deep";
+    stdfs::create_directories(tree);
+    stdfs::create_directories(dir / "elsewhere");
+    makeDirectoryChain(tree, 200);
+    stdfs::path level50 = tree;
+    for (int i = 0; i < 50; ++i) level50 /= "d";
+    const stdfs::path moved = dir / "elsewhere" / "d";
+
+    bool ok = true;
+    BTHErrorRef error;
+    int postBelow = 0, postAbove = 0;
+    walkAll(tree, &ok, &error, [&](const BTHWalkEntry& e) {
+        if (e.level == 200 && e.kind == Kind::DirectoryPre) stdfs::rename(level50, moved);
+        if (e.kind == Kind::DirectoryPost) ++(e.level > 50 ? postBelow : postAbove);
+    });
+    EXPECT_FALSE(ok);
+    EXPECT_TRUE(stdfs::exists(moved / "d"));
+    EXPECT_EQ(postBelow, 150);
+    EXPECT_EQ(postAbove, 0) << "the walk went on above the moved directory";
+}
+
 }  // namespace
 }  // namespace berth
