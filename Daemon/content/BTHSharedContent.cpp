@@ -29,9 +29,11 @@ bool clientHasSystemGroup(const BTHClientConnection& client, const std::string& 
     return std::find(groups.begin(), groups.end(), group) != groups.end();
 }
 
-// The POSIX error of a contained open that failed, as the cause of a refusal.
+// The cause of a refusal: none when the check refused the path (its line
+// says why), else the POSIX error of the open that failed.
 BTHErrorRef openError(const char* bthFunctionName, const std::filesystem::path& url) {
     const int err = errno;
+    if (err == EXDEV) return nullptr;
     return BTHMakePOSIXError(err, "open of %@ failed: %s", url, std::strerror(err));
 }
 
