@@ -28,6 +28,17 @@ std::filesystem::path libraryURL(const BTHMetadata& container) {
     return container.url() / "Library";
 }
 
+// The remembered assets directory. The metadata file lies in the app's own
+// container, so its name is used only when it is one plain name in
+// "Library"; any other counts as a directory that no longer exists.
+std::optional<std::filesystem::path> rememberedAssetsURL(const BTHMetadata& container) {
+    const std::optional<std::string>& name = container.userManagedAssetsDirName();
+    if (!name || name->empty() || *name == "." || *name == ".." ||
+        name->find('/') != std::string::npos || name->find('\0') != std::string::npos)
+        return std::nullopt;
+    return libraryURL(container) / *name;
+}
+
 // The application's data container, or the error of its absence.
 BTHMetadataRef dataContainer(const char* bthFunctionName, uid_t userId,
                              const std::string& identifier, BTHErrorRef* failure) {
@@ -109,8 +120,7 @@ BTHErrorRef deleteInContainer(const char* bthFunctionName, BTHClientConnection& 
                               const std::string& identifier, const BTHMetadata& container,
                               const std::string& relativePath) {
     BTHFileManager& fileManager = BTHFileManager::defaultManager();
-    const std::filesystem::path assets =
-        libraryURL(container) / *container.userManagedAssetsDirName();
+    const std::filesystem::path assets = *rememberedAssetsURL(container);
     const std::filesystem::path asset = BTHAppendRelativePath(assets, relativePath);
     if (!fileManager.realPathForURL(asset, assets) ||
         asset.lexically_normal() == (assets / "").lexically_normal())
@@ -149,11 +159,13 @@ std::optional<std::filesystem::path> userManagedAssetsURLForUser(
                                 "No URL in container metadata object: %@", container);
         }
         BTHIdentifierLockGuard lock(container->uuid().string(), true);
-        if (const std::optional<std::string>& name = container->userManagedAssetsDirName()) {
-            const std::filesystem::path assets = libraryURL(*container) / *name;
-            if (BTHFileManager::defaultManager().itemDoesNotExistAtURL(assets)) {
-                return BTHMakeError(BTHErrorInvalidArgument, nullptr,
-                                    "User Managed Assets path does not exist: %@", assets);
+        if (container->userManagedAssetsDirName()) {
+            const std::optional<std::filesystem::path> assets = rememberedAssetsURL(*container);
+            if (!assets || BTHFileManager::defaultManager().itemDoesNotExistAtURL(*assets)) {
+                return BTHMakeError(
+                    BTHErrorInvalidArgument, nullptr, "User Managed Assets path does not exist: %@",
+                    assets.value_or(BTHAppendRelativePath(libraryURL(*container),
+                                                          *container->userManagedAssetsDirName())));
             }
             result = assets;
             return BTHErrorRef();
@@ -186,7 +198,7 @@ void deleteUserManagedAssetForUser(BTHClientConnection& client, uid_t userId,
         const BTHMetadataRef container =
             dataContainer(bthFunctionName, userId, *identifier, &refused);
         if (!container) return refused;
-        if (container->url().empty() || !container->userManagedAssetsDirName()) {
+        if (container->url().empty() || !rememberedAssetsURL(*container)) {
             return BTHMakeError(
                 BTHErrorInvalidArgument, nullptr,
                 "No userManagedAssetsDirName or URL in container metadata object: %@", container);

@@ -28,10 +28,10 @@ inline constexpr const char* kBTHUserManagedAssetsPrefix = "sys.kelp.UserManaged
 // The assets directory of the data container (class 2) of `identifier` for
 // `userId`, made on first use, under the container's identifier lock. None
 // with the code through `error`: 11 for a missing identifier, an unknown
-// container, or a remembered directory that no longer exists (it is not
-// made again), 6 when the directory cannot be made, given its mode or its
-// owner (it stays in place), the metadata write's code, 45 when the cache
-// cannot take the changed record, 40 on an exception.
+// container, or a remembered directory that no longer exists or whose
+// remembered name is not one plain name (it is not made again), 6 when the directory cannot be
+// made, given its mode or its owner (it stays in place), the metadata write's code, 45 when the
+// cache cannot take the changed record, 40 on an exception.
 std::optional<std::filesystem::path> userManagedAssetsURLForUser(
     uid_t userId, const std::optional<std::string>& identifier, uint64_t* error);
 

@@ -164,6 +164,27 @@ TEST_F(BTHUserManagedAssetsTest, DeletesItemsInsideAndRefusesEveryWayOut) {
     expectOutsideUntouched();
 }
 
+// The name is kept in a metadata file inside the app's own container: one
+// that is not a single plain name (written there by the app, say) leads
+// nowhere, neither for the path nor for deletion.
+TEST_F(BTHUserManagedAssetsTest, ARememberedNameThatIsNotOnePlainNameIsNotFollowed) {
+    ASSERT_EQ(assets(identifier_).first, 1u);
+    const std::string climb = outside_->path().lexically_relative(container_ / "Library").string();
+    for (const std::string& name :
+         {outside_->path().string(), climb, std::string(".."), std::string("."), std::string()}) {
+        BTHMetadataRef record = BTHContainerCache::sharedInstance().containerForUser(
+            mobile_, BTHContainerClassDataApplication, identifier_, false, nullptr);
+        ASSERT_TRUE(record);
+        record->setUserManagedAssetsDirName(name);
+        ASSERT_TRUE(record->writeMetadataToDisk(nullptr));
+        BTHContainerCache::sharedInstance().resetForTesting();
+        EXPECT_EQ(assets(identifier_).first, BTHErrorInvalidArgument) << name;
+        for (const char* path : {"secret", "inner/secret", "inner", ""})
+            EXPECT_EQ(remove(path), BTHErrorInvalidArgument) << name << " " << path;
+        expectOutsideUntouched();
+    }
+}
+
 TEST_F(BTHUserManagedAssetsTest, AComponentSwappedForALinkNeverLeadsOutside) {
     const stdfs::path directory = *assets(identifier_).second;
     constexpr int kFiles = 150;
