@@ -193,7 +193,6 @@ TEST_F(BTHUserManagedAssetsTest, AComponentSwappedForALinkNeverLeadsOutside) {
         test::writeFile(directory / "victim" / "inner" / std::to_string(i), "inside");
         test::writeFile(outside_->path() / "inner" / std::to_string(i), "outside");
     }
-    int removed = 0;
     {
         test::LinkSwapper swapper(directory, outside_->path());
         for (int i = 0; i < kFiles; ++i) {
@@ -201,12 +200,16 @@ TEST_F(BTHUserManagedAssetsTest, AComponentSwappedForALinkNeverLeadsOutside) {
             EXPECT_TRUE(code == 1 || code == BTHErrorInvalidPath ||
                         code == BTHErrorMoveToDeathRowFailed)
                 << code;
-            if (code == 1) ++removed;
         }
     }
-    for (int i = 0; i < kFiles; ++i)
+    // Whatever the swapping refused is still inside and goes now; the
+    // outside files all stay.
+    for (int i = 0; i < kFiles; ++i) {
+        EXPECT_EQ(remove("victim/inner/" + std::to_string(i)), 1u) << i;
         EXPECT_EQ(test::readFile(outside_->path() / "inner" / std::to_string(i)), "outside") << i;
-    EXPECT_GT(removed, 0);
+    }
+    EXPECT_TRUE(test::namesIn(directory / "victim" / "inner").empty());
+    EXPECT_EQ(test::namesIn(outside_->path() / "inner").size(), kFiles + 1u);
 }
 
 }  // namespace
