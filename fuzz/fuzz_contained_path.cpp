@@ -111,11 +111,18 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
             if (!error && !inside(resolved.string(), base)) __builtin_trap();
         }
     }
-    if (auto item = manager.openContainedItem(fs::path(path), tree.base())) {
+    // Both opens hand back a directory that really is inside, and an entry
+    // name that is one name.
+    for (const auto& item : {manager.openContainedItem(fs::path(path), tree.base()),
+                             manager.openContainedEntry(fs::path(path), tree.base())}) {
+        if (!item) continue;
         char where[4096] = {};
         const std::string link = "/proc/self/fd/" + std::to_string(item->parent.get());
         const ssize_t n = ::readlink(link.c_str(), where, sizeof where - 1);
         if (n <= 0 || !inside(std::string(where, n), base)) __builtin_trap();
+        if (item->name.empty() || item->name == "." || item->name == ".." ||
+            item->name.find('/') != std::string::npos)
+            __builtin_trap();
     }
     return 0;
 }

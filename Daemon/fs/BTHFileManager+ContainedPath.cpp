@@ -59,6 +59,13 @@ std::string withoutPrivatePrefix(const std::string& path) {
     return path.rfind("/private/", 0) == 0 ? path.substr(8) : path;
 }
 
+// `path` without trailing slashes ("/" stays).
+std::string pathWithoutTrailingSlashes(const std::filesystem::path& path) {
+    std::string text = path.string();
+    while (text.size() > 1 && text.back() == '/') text.pop_back();
+    return text;
+}
+
 // The index of the first component that counts when real paths are
 // compared: past "/" and a transparent "private".
 size_t firstComparedComponent(const std::vector<std::string>& components) {
@@ -230,39 +237,94 @@ std::optional<std::filesystem::path> BTHFileManager::realPathForURL(
     return real;
 }
 
+namespace {
+
+// The directory at `realDir`, a real path at or below `realBase`, opened
+// (O_PATH) beneath the base's own descriptor with no link followed, no magic
+// link and no other file system on the way. Invalid with errno EXDEV when
+// `realDir` is not below the base, else with the open's error.
+UniqueFd openDirectoryBeneath(const std::filesystem::path& realBase,
+                              const std::filesystem::path& realDir) {
+    const std::string relative = realDir.lexically_relative(realBase).string();
+    const std::vector<std::string> parts = pathComponents(relative);
+    if (parts.empty() || parts.front() == "..") {
+        errno = EXDEV;
+        return {};
+    }
+    UniqueFd baseFd = fs::openNoFollow(realBase, O_PATH | O_DIRECTORY);
+    if (!baseFd) return {};
+    long dir =
+        openat2(baseFd.get(), relative.c_str(), O_PATH | O_DIRECTORY,
+                RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
+    if (dir < 0 && errno == ENOSYS) {
+        // Kernels before 5.6: the same refusal of every link, component by
+        // component from the root down.
+        return fs::openNoFollow(realDir, O_PATH | O_DIRECTORY);
+    }
+    if (dir < 0) return {};
+    return UniqueFd(static_cast<int>(dir));
+}
+
+}  // namespace
+
 std::optional<BTHFileManager::ContainedItem> BTHFileManager::openContainedItem(
     const std::filesystem::path& suspicious, const std::filesystem::path& base) {
     std::optional<std::filesystem::path> real = realPathForURL(suspicious, base);
     std::optional<std::filesystem::path> realBase =
         real ? _realPathForURL(withoutPrivatePrefix(base.string()), false) : std::nullopt;
-    if (!real || !realBase) {
+    // The base itself is not an item inside it.
+    if (!real || !realBase || *real == *realBase) {
         errno = EXDEV;
         return std::nullopt;
     }
     // Both real paths are free of links and ".."; what lies between them is
     // opened beneath the base's own descriptor, refusing any link that has
     // appeared since.
-    const std::string relative = real->lexically_relative(*realBase).string();
-    const std::vector<std::string> parts = pathComponents(relative);
-    if (parts.empty() || relative == "." || parts.front() == "..") {
-        errno = EXDEV;  // the base itself is not an item inside it
+    UniqueFd parent = openDirectoryBeneath(*realBase, real->parent_path());
+    if (!parent) return std::nullopt;
+    return ContainedItem{std::move(parent), real->filename().string(), *real};
+}
+
+std::optional<BTHFileManager::ContainedItem> BTHFileManager::openContainedEntry(
+    const std::filesystem::path& suspicious, const std::filesystem::path& base) {
+    if (!realPathForURL(suspicious, base)) {
+        errno = EXDEV;
         return std::nullopt;
     }
-    UniqueFd baseFd = fs::openNoFollow(*realBase, O_PATH | O_DIRECTORY);
-    if (!baseFd) return std::nullopt;
-    const std::string parentPath =
-        parts.size() == 1 ? "." : joinComponents(parts, 0, parts.size() - 1);
-    long parent =
-        openat2(baseFd.get(), parentPath.c_str(), O_PATH | O_DIRECTORY,
-                RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV);
-    if (parent < 0 && errno == ENOSYS) {
-        // Kernels before 5.6: the same refusal of every link, component by
-        // component from the base down.
-        UniqueFd fallback = fs::openNoFollow(real->parent_path(), O_PATH | O_DIRECTORY);
-        parent = fallback ? fallback.release() : -1;
+    // Free of ".." now, so the lexical form names the same entry; "." and
+    // trailing slashes go.
+    const std::filesystem::path entry =
+        withoutPrivatePrefix(suspicious.lexically_normal().string());
+    const std::filesystem::path basePath = withoutPrivatePrefix(base.lexically_normal().string());
+    std::filesystem::path parentPath;
+    std::string name;
+    if (!fs::splitParent(entry, &parentPath, &name) ||
+        parentPath.string().size() < pathWithoutTrailingSlashes(basePath).size()) {
+        errno = EXDEV;  // the base itself is not an entry inside it
+        return std::nullopt;
     }
-    if (parent < 0) return std::nullopt;
-    return ContainedItem{UniqueFd(static_cast<int>(parent)), parts.back(), *real};
+    std::optional<std::filesystem::path> realParent = realPathForURL(parentPath, basePath);
+    std::optional<std::filesystem::path> realBase =
+        realParent ? _realPathForURL(basePath, false) : std::nullopt;
+    if (!realParent || !realBase) {
+        errno = EXDEV;
+        return std::nullopt;
+    }
+    UniqueFd parent = openDirectoryBeneath(*realBase, *realParent);
+    if (!parent) return std::nullopt;
+    return ContainedItem{std::move(parent), name, *realParent / name};
+}
+
+bool BTHFileManager::moveContainedItem(const ContainedItem& source, const ContainedItem& dest,
+                                       BTHErrorRef* error) {
+    BTH_FUNCTION("-[BTHFileManager moveContainedItem:toItem:error:]");
+    if (::renameat(source.parent.get(), source.name.c_str(), dest.parent.get(),
+                   dest.name.c_str()) == 0)
+        return true;
+    const int err = errno;
+    BTHSetError(error, BTHMakePOSIXError(err, "rename of %@ to %@ failed: %s", source.realPath,
+                                         dest.realPath, errorText(err)));
+    return false;
 }
 
 }  // namespace berth

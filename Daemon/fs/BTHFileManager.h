@@ -152,6 +152,20 @@ class BTHFileManager {
     std::optional<ContainedItem> openContainedItem(const std::filesystem::path& suspicious,
                                                    const std::filesystem::path& base);
 
+    // The entry `suspicious` names, itself: like openContainedItem, but its
+    // last component is not resolved, so a link there is the entry (as
+    // rename(2) or unlink(2) of the path would take it). Its directory, with
+    // every link before it resolved, is proven inside `base` too and opened
+    // beneath the base's descriptor; `realPath` is that directory's real
+    // path with the entry's name. The base itself is not an entry (EXDEV).
+    std::optional<ContainedItem> openContainedEntry(const std::filesystem::path& suspicious,
+                                                    const std::filesystem::path& base);
+    // Renames `source` to `dest`, each reached through its directory's
+    // descriptor, so the move happens where the checks were made. The same
+    // file system is needed (EXDEV otherwise); a POSIX error on failure.
+    bool moveContainedItem(const ContainedItem& source, const ContainedItem& dest,
+                           BTHErrorRef* error);
+
     // The real path of `url` (realpath(3)); when `allowNonExistentPathComponents`
     // and a component is missing, that of its longest existing prefix with
     // the rest appended. Null on failure, logged ("Failed to realpath %s : %s

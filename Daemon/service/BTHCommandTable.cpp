@@ -5,6 +5,7 @@
 #include "BTHError.h"
 #include "BTHGroupCommands.h"
 #include "BTHProtectionCommands.h"
+#include "BTHSharedContentCommands.h"
 #include "BTHUsageCommands.h"
 
 namespace berth {
@@ -48,6 +49,10 @@ constexpr struct {
     {21, setDataProtection},
     {22, recreateDefaultStructure},
     {23, diskUsage},
+    {26, stageSharedContent},
+    {27, setNetworkExtension},
+    {28, userManagedAssetsPath},
+    {29, deleteUserManagedAsset},
 };
 
 BTHCommandHandler handlerOf(uint64_t command) {

@@ -19,6 +19,7 @@
 #include "GroupCommands.h"
 #include "LockCommand.h"
 #include "SendCommand.h"
+#include "SharedContentCommands.h"
 #include "SignCommand.h"
 #include "UpcallCommand.h"
 #include "UsageCommands.h"
@@ -40,6 +41,7 @@ struct Arguments {
     UsageOptions usage;
     GroupOptions group;
     CodeSigningCommandOptions codeSigning;
+    SharedContentOptions content;
 };
 
 std::chrono::milliseconds timeoutOf(double seconds) {
@@ -220,6 +222,45 @@ CLI::App* addGroupCommand(CLI::App& parent, const char* name, const char* descri
     return command;
 }
 
+// Adds "stage-shared", "net-extension" and "assets" with its two
+// subcommands; returns every one that runs an action.
+std::vector<CLI::App*> addSharedContentCommands(CLI::App& app, Arguments& args) {
+    SharedContentOptions& options = args.content;
+    auto actionOf = [&options, &args](CLI::App* command, SharedContentAction action) {
+        command->callback([&options, action] { options.action = action; });
+        addConnectionOptions(command, args);
+        return command;
+    };
+    CLI::App* stage = actionOf(
+        app.add_subcommand("stage-shared",
+                           "Move an item to another place inside a system-group container"),
+        SharedContentAction::StageShared);
+    stage->add_option("group", options.identifier, "The system group identifier")->required();
+    stage->add_option("source", options.source, "The item, relative to the container")->required();
+    stage->add_option("dest", options.dest, "Its new place, relative to the container")->required();
+    CLI::App* net = actionOf(app.add_subcommand("net-extension",
+                                                "Make a network plug-in's data container and "
+                                                "record it for the network-extension agent"),
+                             SharedContentAction::NetExtension);
+    net->add_option("identifier", options.identifier, "The plug-in's identifier")->required();
+    net->add_option("--class", options.containerClass,
+                    "Data/VPNPlugin (6, default) or Data/Application (2)");
+    CLI::App* assets = app.add_subcommand(
+        "assets", "An app's user-managed assets directory (current mobile user)");
+    assets->require_subcommand(1);
+    CLI::App* path =
+        actionOf(assets->add_subcommand("path", "Print the assets directory, made on first use"),
+                 SharedContentAction::AssetsPath);
+    path->add_option("identifier", options.identifier, "The app's identifier")->required();
+    CLI::App* remove = actionOf(
+        assets->add_subcommand("delete", "Move an item of the assets directory to death row"),
+        SharedContentAction::AssetsDelete);
+    remove->add_option("identifier", options.identifier, "The app's identifier")->required();
+    remove->add_option("path", options.source, "The item, relative to the assets directory")
+        ->required();
+    return {stage, net, path, remove};
+}
+
 // Adds "codesign" with its three subcommands.
 CLI::App* addCodeSigningCommands(CLI::App& app, Arguments& args) {
     CLI::App* codesign = app.add_subcommand("codesign", "Record or read code-signing information");
@@ -383,6 +424,7 @@ int main(int argc, char** argv) {
         groupCommands.push_back(
             addGroupCommand(app, action.name, action.description, action.action, args));
     CLI::App* codesign = addCodeSigningCommands(app, args);
+    const std::vector<CLI::App*> contentCommands = addSharedContentCommands(app, args);
 
     // Asked by the shells' completion scripts; never shown in the help.
     if (argc >= 2 && std::string_view(argv[1]) == "__complete")
@@ -421,6 +463,13 @@ int main(int argc, char** argv) {
         args.group.socket = args.send.socket;
         args.group.timeout = timeoutOf(args.timeoutSeconds);
         return runGroupCommand(args.group, std::cout, std::cerr);
+    }
+    for (CLI::App* command : contentCommands) {
+        if (!command->parsed()) continue;
+        args.content.json = args.json;
+        args.content.socket = args.send.socket;
+        args.content.timeout = timeoutOf(args.timeoutSeconds);
+        return runSharedContentCommand(args.content, std::cout, std::cerr);
     }
     if (codesign->parsed()) {
         args.codeSigning.json = args.json;

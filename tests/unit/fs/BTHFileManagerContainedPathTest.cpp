@@ -168,6 +168,49 @@ TEST_F(ContainedPathTest, TheOpenedItemIsTheCheckedOne) {
     EXPECT_EQ(errno, EXDEV);
 }
 
+// An entry is named itself: links before its last name are resolved, a link
+// as its last name is the entry; moving two entries renames between their
+// directories.
+TEST_F(ContainedPathTest, AnEntryIsItsOwnLastNameAndMovesWhereItWasChecked) {
+    const struct {
+        const char* suspicious;
+        const char* name;
+        const char* realPath;  // below the base
+    } entries[] = {
+        {"/inlink/file", "file", "a/file"},      // the directory through a link
+        {"/a/sibling", "sibling", "a/sibling"},  // a link stays the entry
+        {"/a/./file", "file", "a/file"},         // "." goes
+        {"/a/new", "new", "a/new"},              // not there yet
+        {"/-rf", "-rf", "-rf"},                  // only a name
+    };
+    for (const auto& e : entries) {
+        auto entry = test::manager().openContainedEntry(base().string() + e.suspicious, base());
+        ASSERT_TRUE(entry) << e.suspicious << ": " << strerror(errno);
+        EXPECT_EQ(entry->name, e.name) << e.suspicious;
+        EXPECT_EQ(entry->realPath, base() / e.realPath) << e.suspicious;
+    }
+    for (const char* refused : {"", "/", "/.", "/a/up2/secret", "/dirlink/x", "/a/hop/secret",
+                                "/abs/passwd", "/../base/a"}) {
+        EXPECT_FALSE(test::manager().openContainedEntry(base().string() + refused, base()))
+            << refused;
+        EXPECT_EQ(errno, EXDEV) << refused;
+    }
+    // Its directory missing: proven inside, but nothing to open.
+    EXPECT_FALSE(test::manager().openContainedEntry(base() / "none/x", base()));
+    EXPECT_EQ(errno, ENOENT);
+
+    auto from = test::manager().openContainedEntry(base() / "inlink/file", base());
+    auto to = test::manager().openContainedEntry(base() / "moved", base());
+    ASSERT_TRUE(from && to);
+    BTHErrorRef error;
+    ASSERT_TRUE(test::manager().moveContainedItem(*from, *to, &error)) << error;
+    EXPECT_EQ(test::readFile(base() / "moved"), "inside");
+    EXPECT_FALSE(fs::exists(base() / "a/file"));
+    EXPECT_FALSE(test::manager().moveContainedItem(*from, *to, &error));
+    test::expectPOSIXError(error, ENOENT);
+    EXPECT_EQ(test::readFile(root_ / "outside/secret"), "secret");
+}
+
 // The directory of a checked item swapped for a link out between check and
 // use, over and over: the open fails or reaches the inside file, never the
 // secret.

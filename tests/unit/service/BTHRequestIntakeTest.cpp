@@ -1,5 +1,8 @@
 #include "BTHRequestIntake.h"
 
+#include <algorithm>
+#include <vector>
+
 #include "BTHCommandTable.h"
 #include "BTHError.h"
 #include "ScratchDeviceRoot.h"
@@ -56,8 +59,10 @@ Value command(uint64_t n) {
 // container and a missing system group are not its (55), it has no system
 // groups (1, none), processing needs an identifier (18), getting finds
 // nothing (21) and invalidating succeeds. A caller that may look up others
-// gets any system container.
+// gets any system container. Shared content, network extensions and assets
+// (26 to 29) need an identifier (11).
 uint64_t reachedHandler(uint64_t command, bool mayLookUpOthers = false) {
+    if (command >= 26 && command <= 29) return BTHErrorInvalidArgument;
     if (command == 3 || command == 16 || command == 20) return BTHErrorSuccess;
     if (command == 15) return mayLookUpOthers ? BTHErrorSuccess : BTHErrorNotEntitled;
     if (command == 17) return BTHErrorNotEntitled;
@@ -110,6 +115,26 @@ TEST(BTHRequestIntakeTest, SpecificEntitlementsAndTheWipeList) {
     EXPECT_EQ(run(command(26), migrator).first, BTHErrorNotEntitled);
     const auto falseValue = peerWith(dict({{kBTHEntitlementDataMigration, false}}));
     EXPECT_EQ(run(command(24), falseValue).first, BTHErrorNotEntitled);
+
+    // Each of the content entitlements opens its own commands only.
+    const struct {
+        const char* entitlement;
+        std::vector<uint64_t> opens;
+    } contentCases[] = {
+        {kBTHEntitlementStageSharedContent, {26}},
+        {kBTHEntitlementNetworkExtension, {27}},
+        {kBTHEntitlementUserManagedAssets, {28, 29}},
+    };
+    for (const auto& entry : contentCases) {
+        const auto peer = peerWith(dict({{entry.entitlement, true}}));
+        for (uint64_t c = 26; c <= 29; ++c) {
+            const bool opens =
+                std::find(entry.opens.begin(), entry.opens.end(), c) != entry.opens.end();
+            EXPECT_EQ(run(command(c), peer).first,
+                      opens ? reachedHandler(c) : uint64_t{BTHErrorNotEntitled})
+                << entry.entitlement << " " << c;
+        }
+    }
 
     test::LogCapture log;
     Value ids = Value::array();
