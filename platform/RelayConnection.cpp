@@ -61,6 +61,10 @@ RelayConnection::RelayConnection(Passkey, UniqueFd socket, RelayPeer peer,
 RelayConnection::~RelayConnection() {
     // A connection never resumed still holds its queue suspended; its
     // pending events go with it.
+    if (!closed_ && options_.budget) {
+        options_.budget->charge(peer_.effectiveUserId(), -static_cast<ptrdiff_t>(charged_));
+        options_.budget->releaseConnection(peer_.effectiveUserId());
+    }
 }
 
 void RelayConnection::setEventHandler(EventHandler handler) {
@@ -121,6 +125,8 @@ bool RelayConnection::sendReply(uint64_t messageId, const Value& body) {
     }
     output_.insert(output_.end(), frame.begin(), frame.end());
     if (!flushLocked(released)) return false;
+    chargeLocked(released);
+    if (closed_) return false;
     updateInterestLocked();
     return true;
 }
@@ -135,6 +141,7 @@ void RelayConnection::ready(uint32_t events) {
     } else if (events & (EPOLLHUP | EPOLLERR)) {
         closeLocked(kLogDebug, "the peer hung up", released);
     }
+    chargeLocked(released);
     updateInterestLocked();
 }
 
@@ -207,9 +214,25 @@ void RelayConnection::updateInterestLocked() {
     if (poller_->modify(socket_.get(), token_, wanted) == 0) interest_ = wanted;
 }
 
+void RelayConnection::chargeLocked(Released& released) {
+    if (closed_ || !options_.budget) return;
+    const size_t held = decoder_.buffered() + pendingOutputLocked();
+    const ptrdiff_t delta = static_cast<ptrdiff_t>(held) - static_cast<ptrdiff_t>(charged_);
+    if (delta == 0) return;
+    charged_ = held;
+    // Only growth is refused: a connection that gives bytes back may stay.
+    if (!options_.budget->charge(peer_.effectiveUserId(), delta) && delta > 0)
+        closeLocked(kLogDebug, "its user buffers more than allowed", released);
+}
+
 void RelayConnection::closeLocked(int level, const std::string& reason, Released& released) {
     if (closed_) return;
     closed_ = true;
+    if (options_.budget) {
+        options_.budget->charge(peer_.effectiveUserId(), -static_cast<ptrdiff_t>(charged_));
+        charged_ = 0;
+        options_.budget->releaseConnection(peer_.effectiveUserId());
+    }
     released.lines.emplace_back(level, reason);
     if (token_ != 0) released.watcher = poller_->remove(socket_.get(), token_);
     token_ = 0;

@@ -42,6 +42,7 @@
 #include "core/Value.h"
 #include "platform/RelayPeer.h"
 #include "platform/RelayPoller.h"
+#include "platform/RelayUserBudget.h"
 #include "platform/UniqueFd.h"
 #include "platform/WorkQueue.h"
 
@@ -136,6 +137,10 @@ class RelayConnection final : public RelayPoller::Watcher,
         // The queue the connection's serial queue runs on; null: the global
         // queue.
         std::shared_ptr<WorkQueue> target;
+        // Where the connection, already admitted for its user, charges what
+        // it buffers and gives its place back when it ends; null: no limits
+        // per user.
+        std::shared_ptr<RelayUserBudget> budget;
     };
 
     // A connection over the connected, non-blocking `socket`, suspended:
@@ -209,6 +214,9 @@ class RelayConnection final : public RelayPoller::Watcher,
     // Ends the connection. The poller's reference goes to `released`, to be
     // dropped once the lock is let go.
     void closeLocked(int level, const std::string& reason, Released& released);
+    // Charges what the connection buffers now to its user; ends the
+    // connection when that puts the user over its limit.
+    void chargeLocked(Released& released);
     void dispatchLocked(RelayEvent event);
     void deliver(const RelayEvent& event);
 
@@ -228,6 +236,7 @@ class RelayConnection final : public RelayPoller::Watcher,
     size_t queued_ = 0;  // requests dispatched and not yet handled
     std::vector<uint8_t> output_;
     size_t outputStart_ = 0;  // first byte of output_ not yet written
+    size_t charged_ = 0;      // bytes charged to the user's budget
 };
 
 }  // namespace berth

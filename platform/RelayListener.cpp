@@ -28,6 +28,13 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
           queue_(queue ? std::move(queue) : WorkQueue::global(QueuePriority::normal)),
           options_(std::move(options)),
           poller_(std::move(poller)),
+          budget_(std::make_shared<RelayUserBudget>(
+              options_.userLimits,
+              // Connections may outlive the listener: the budget keeps its own
+              // copy of where to log.
+              [log = options_.log, label = options_.label](const std::string& message) {
+                  if (log) log(kLogError, label + ": " + message);
+              })),
           // Kept for the moment the process runs out of descriptors.
           reserve_(::open("/dev/null", O_RDONLY | O_CLOEXEC)) {
         if (!options_.codeSigning) options_.codeSigning = std::make_shared<CodeSigningRegistry>();
@@ -109,11 +116,14 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
             log(kLogError, "refusing a connection: " + why);
             return;
         }
+        // Closed at once: the peer sees its connection end before any reply.
+        if (!budget_->admitConnection(peer->effectiveUserId())) return;
         RelayConnection::Options connectionOptions;
         connectionOptions.label = options_.label + ".peer." + std::to_string(peer->pid());
         connectionOptions.limits = options_.limits;
         connectionOptions.log = options_.log;
         connectionOptions.target = queue_;
+        connectionOptions.budget = budget_;
         std::shared_ptr<RelayConnection> connection = RelayConnection::make(
             std::move(socket), std::move(*peer), poller_, std::move(connectionOptions));
 
@@ -145,6 +155,7 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
     const std::shared_ptr<WorkQueue> queue_;
     Options options_;
     const std::shared_ptr<RelayPoller> poller_;
+    const std::shared_ptr<RelayUserBudget> budget_;
     UniqueFd reserve_;
 
     mutable std::mutex mutex_;

@@ -42,6 +42,8 @@ class RelayListener {
         // root's signature registry.
         std::shared_ptr<CodeSigningService> codeSigning;
         RelayLimits limits;
+        // What one user other than root may hold; see RelayUserBudget.
+        RelayUserLimits userLimits;
         RelayLog log;
     };
 

@@ -10,6 +10,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <optional>
 
@@ -41,6 +42,33 @@ namespace berth {
 namespace {
 
 std::atomic<uint32_t> gLogFileCount{1};
+
+// A positive count from the service's environment, else `fallback`.
+size_t limitFromEnvironment(const char* name, size_t fallback) {
+    BTH_FUNCTION("main");
+    const char* text = std::getenv(name);
+    if (!text) return fallback;
+    char* end = nullptr;
+    errno = 0;
+    const unsigned long long value = std::strtoull(text, &end, 10);
+    if (errno != 0 || end == text || *end != '\0' || value == 0 || text[0] == '-') {
+        BTHLogError("Ignoring %s=%s: not a positive number; using %llu", name, text,
+                    static_cast<unsigned long long>(fallback));
+        return fallback;
+    }
+    return static_cast<size_t>(value);
+}
+
+// What one user other than root may hold on the request socket, as the
+// service's configuration sets it.
+RelayUserLimits userLimitsFromEnvironment() {
+    RelayUserLimits limits;
+    limits.maxConnectionsPerUser =
+        limitFromEnvironment("BERTH_MAX_CONNECTIONS_PER_USER", limits.maxConnectionsPerUser);
+    limits.maxBufferedBytesPerUser =
+        limitFromEnvironment("BERTH_MAX_BUFFERED_BYTES_PER_USER", limits.maxBufferedBytesPerUser);
+    return limits;
+}
 
 constexpr uint32_t kLogFileCount = 1;
 constexpr uint64_t kLogSizeLimit = 102400;
@@ -132,6 +160,7 @@ std::unique_ptr<RelayListener> startListener(const std::shared_ptr<WorkQueue>& l
     RelayListener::Options options;
     options.label = kBTHServiceName;
     options.codeSigning = std::make_shared<CodeSigningRegistry>();
+    options.userLimits = userLimitsFromEnvironment();
     options.log = [](int level, const std::string& message) {
         BTH_FUNCTION("BTHProcessRelayEvent");
         BTHLog(level, "%@", message);

@@ -20,7 +20,8 @@ class RelayTestServer {
     // Peers are identified by `signing`, by default the scratch device
     // root's registry (which signs nothing).
     explicit RelayTestServer(Handler handler, RelayLimits limits = {},
-                             std::shared_ptr<CodeSigningService> signing = nullptr)
+                             std::shared_ptr<CodeSigningService> signing = nullptr,
+                             RelayUserLimits userLimits = {})
         : state_(std::make_shared<State>()) {
         state_->handler = std::move(handler);
         std::string why;
@@ -34,6 +35,7 @@ class RelayTestServer {
         RelayListener::Options options;
         options.label = "relay.test";
         options.limits = limits;
+        options.userLimits = userLimits;
         options.codeSigning = std::move(signing);
         options.log = [state = state_](int level, const std::string& line) {
             std::lock_guard lock(state->mutex);
