@@ -30,6 +30,7 @@
 #include "platform/DeviceProperties.h"
 #include "platform/LockStateNotification.h"
 #include "platform/NamedSemaphore.h"
+#include "platform/ProcessAttachPolicy.h"
 #include "platform/RelayListener.h"
 #include "platform/RelayTransaction.h"
 #include "platform/RunLoop.h"
@@ -188,6 +189,19 @@ void connectCodeSigningConsequences() {
         mapping->setHooks(BTHMakeCodeSigningHooks(BTHGroupManager::defaultManager()));
 }
 
+// A launched app's identity is only as good as the kernel's refusal to let
+// the user's other processes attach to it; the service installs a setting
+// that restricts attaching, and an administrator who lifts it is told.
+void warnIfAppsCanBeAttached() {
+    BTH_FUNCTION("main");
+    const std::optional<int> level = processAttachRestriction();
+    if (processAttachRestricted(level)) return;
+    BTHLogWarning(
+        "Processes of a user may attach to each other (kernel.yama.ptrace_scope is %@): any "
+        "program of an app's user can take over a launched app and speak with its identity",
+        level ? std::to_string(*level) : std::string("not available"));
+}
+
 }  // namespace
 
 uint32_t BTHLogFileCount() {
@@ -215,6 +229,7 @@ int BTHDaemonMain() {
     BTHDeathRowQueue()->setTarget(WorkQueue::global(QueuePriority::background));
     BTHClientConnection::sharedClientConnection();
     connectCodeSigningConsequences();
+    warnIfAppsCanBeAttached();
 
     const bool firstBoot = !NamedSemaphore::exists(kBTHFirstBootSemaphoreName);
     if (firstBoot) {

@@ -32,6 +32,8 @@ check_units() {
     [[ $(grep '^ExecStart=' "$units/berthd.service") == "ExecStart=/usr/libexec/berthd" ]] ||
         fail "the unit does not start the installed daemon: $(grep '^ExecStart=' "$units/berthd.service")"
     [[ -x $scratch/stage/usr/libexec/berthd ]] || fail "no installed daemon"
+    grep -qx 'kernel.yama.ptrace_scope = 1' "$scratch/stage/usr/lib/sysctl.d/50-berthd.conf" ||
+        fail "no setting that keeps a user's programs from attaching to launched apps"
     for program in berthctl berth-launch; do
         [[ -x $scratch/stage/usr/bin/$program ]] || fail "no installed $program"
     done
