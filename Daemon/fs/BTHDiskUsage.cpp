@@ -49,16 +49,41 @@ struct FileIdHash {
     }
 };
 
-// Opens the directory `relative` (empty: the root itself) beneath `rootFd`;
-// no component may be a link, and no step may leave the root.
-UniqueFd openBeneath(int rootFd, const std::string& relative) {
-    if (relative.empty())
-        return UniqueFd(::openat(rootFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+// The longest piece of a relative path opened in one step; a deeper
+// directory is reached piece by piece, each beneath the last.
+constexpr size_t kPathPiece = 2048;
+
+UniqueFd openPieceBeneath(int dirFd, const std::string& piece) {
     struct open_how how {};
     how.flags = O_RDONLY | O_NOFOLLOW | O_DIRECTORY | O_CLOEXEC;
     how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
     return UniqueFd(
-        static_cast<int>(::syscall(SYS_openat2, rootFd, relative.c_str(), &how, sizeof how)));
+        static_cast<int>(::syscall(SYS_openat2, dirFd, piece.c_str(), &how, sizeof how)));
+}
+
+// Opens the directory `relative` (empty: the root itself) beneath `rootFd`;
+// no component may be a link, and no step may leave the root. Paths longer
+// than the kernel takes in one call (an app may nest its directories deeper
+// than any path allows) are opened in pieces.
+UniqueFd openBeneath(int rootFd, const std::string& relative) {
+    if (relative.empty())
+        return UniqueFd(::openat(rootFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    UniqueFd dir;
+    size_t start = 0;
+    while (start < relative.size()) {
+        size_t end = relative.size();
+        if (end - start > kPathPiece) {
+            end = relative.rfind('/', start + kPathPiece);
+            if (end == std::string::npos || end <= start) {
+                errno = ENAMETOOLONG;  // one name longer than a piece
+                return UniqueFd();
+            }
+        }
+        dir = openPieceBeneath(dir ? dir.get() : rootFd, relative.substr(start, end - start));
+        if (!dir) return dir;
+        start = end + 1;
+    }
+    return dir;
 }
 
 // One measurement: the work list of directories still to read (paths

@@ -155,16 +155,17 @@ std::set<std::string> namesIn(const std::filesystem::path& directory) {
     return names;
 }
 
-void makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery) {
+UniqueFd makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery,
+                            const std::string& name) {
     UniqueFd level(::open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    for (int i = 0; i < depth; ++i) {
-        ASSERT_TRUE(level) << "level " << i << ": " << std::strerror(errno);
-        ASSERT_EQ(::mkdirat(level.get(), "d", 0755), 0) << std::strerror(errno);
+    for (int i = 0; i < depth && level; ++i) {
+        EXPECT_EQ(::mkdirat(level.get(), name.c_str(), 0755), 0) << std::strerror(errno);
         if (fileEvery > 0 && i % fileEvery == 0)
             UniqueFd(::openat(level.get(), "f", O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
-        level = UniqueFd(::openat(level.get(), "d", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        level = UniqueFd(::openat(level.get(), name.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     }
-    ASSERT_TRUE(level);
+    EXPECT_TRUE(level) << "the chain stopped: " << std::strerror(errno);
+    return level;
 }
 
 int openDescriptorCount() {

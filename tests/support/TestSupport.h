@@ -89,10 +89,12 @@ struct stat lstatOf(const std::filesystem::path& path);
 // The names in a directory.
 std::set<std::string> namesIn(const std::filesystem::path& directory);
 
-// Builds `depth` nested directories named "d" below the existing `top`, with
-// a file "f" in every `fileEvery`-th level (0: none), without ever holding a
-// path longer than one name: the chain may be deeper than any path allows.
-void makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery = 0);
+// Builds `depth` nested directories named `name` below the existing `top`,
+// with a file "f" in every `fileEvery`-th level (0: none), without ever
+// holding a path longer than one name: the chain may be deeper than any path
+// allows. Gives the bottom directory, open.
+UniqueFd makeDirectoryChain(const std::filesystem::path& top, int depth, int fileEvery = 0,
+                            const std::string& name = "d");
 
 // How many descriptors this process has open.
 int openDescriptorCount();

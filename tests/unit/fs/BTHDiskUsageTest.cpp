@@ -87,6 +87,26 @@ TEST(BTHDiskUsage, CountsAFileWithSeveralLinksOncePerCall) {
     EXPECT_EQ(manager().diskUsageForURL(dir.path()), allocated(dir / "file"));
 }
 
+// An app may nest its directories deeper than any path the kernel takes in
+// one call: what lies at the bottom is still counted.
+TEST(BTHDiskUsage, ReachesTheBottomOfAChainLongerThanAnyPath) {
+    ScratchDir dir;
+    // 40 names of 250 bytes: a path far beyond what the kernel takes.
+    UniqueFd level = makeDirectoryChain(dir.path(), 40, 0, std::string(250, 'n'));
+    ASSERT_TRUE(level);
+    UniqueFd file(::openat(level.get(), "data", O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+    const std::vector<char> bytes(8192, 'x');
+    ASSERT_EQ(::write(file.get(), bytes.data(), bytes.size()), 8192);
+    ASSERT_EQ(::fsync(file.get()), 0);
+    struct stat st {};
+    ASSERT_EQ(::fstat(file.get(), &st), 0);
+    ASSERT_GT(st.st_blocks, 0);
+
+    LogCapture log;
+    EXPECT_EQ(manager().diskUsageForURL(dir.path()), static_cast<uint64_t>(st.st_blocks) * 512);
+    EXPECT_FALSE(log.contains(3, "Failed to open directory"));
+}
+
 TEST(BTHDiskUsage, FollowsNoLinkAndReadsNothingBelowAMissingRoot) {
     ScratchDir dir;
     ScratchDir outside;
