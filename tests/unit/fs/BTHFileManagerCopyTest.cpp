@@ -1,6 +1,7 @@
 // Copies and same-volume moves: what a copy keeps, missing sources, error
-// texts, and a source tree whose app swaps a subdirectory for a link while
-// it is being copied.
+// texts, a source tree whose app swaps a subdirectory for a link while it is
+// being copied, chains deeper than the descriptor limit, and a directory
+// moved away above the levels the copy holds open.
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/acl.h>
