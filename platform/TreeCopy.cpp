@@ -22,6 +22,11 @@ namespace {
 
 constexpr int kAttemptsPerItem = 4;
 
+// How many of the innermost directory levels keep their source and
+// destination open (two descriptors each); the copy's descriptors stay
+// bounded whatever the depth of the tree.
+constexpr size_t kOpenLevels = 32;
+
 bool changedSinceLstat(int err) {
     return err == ELOOP || err == ENOTDIR || err == ESTALE;
 }
@@ -98,17 +103,65 @@ int copyMetadataAt(int dirFd, const char* name, const struct stat& st) {
     return ::utimensat(dirFd, name, times, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
+// A directory being copied: its source and destination and the names in the
+// source still to copy (read in full on entering: a copy into itself adds to
+// the directory it reads). Among the innermost levels both
+// directories stay open; a level further up is parked: both are closed, and
+// when the copy comes back to it they are opened again as the child's ".."
+// and accepted only if they are the very directories left.
+struct Level {
+    UniqueFd src;
+    UniqueFd dst;
+    struct stat srcSt {};  // the source's lstat: its attributes, and who it is
+    struct stat dstSt {};  // who the destination is
+    std::vector<std::string> names;
+    size_t next = 0;
+
+    bool isOpen() const { return static_cast<bool>(src); }
+
+    void park() {
+        src.reset();
+        dst.reset();
+    }
+
+    // Opens the parked level again through its child's "..". ESTALE when
+    // either is no longer the directory parked: the child was moved away, and
+    // the copy would go on somewhere else.
+    int unpark(const Level& child) {
+        if (int err = reopenParent(child.src.get(), srcSt, &src)) return err;
+        return reopenParent(child.dst.get(), dstSt, &dst);
+    }
+
+  private:
+    static int reopenParent(int child, const struct stat& expected, UniqueFd* parent) {
+        UniqueFd fd(::openat(child, "..", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        struct stat st;
+        if (!fd || ::fstat(fd.get(), &st) != 0) return errno;
+        if (!sameItem(st, expected)) return ESTALE;
+        *parent = std::move(fd);
+        return 0;
+    }
+};
+
+// Copies depth first with an explicit stack of levels, so neither the
+// descriptors nor the stack it uses grow with the depth of the tree.
 class Copier {
   public:
-    int copyEntry(int srcParent, const std::string& srcName, int dstParent,
-                  const std::string& dstName, bool isRoot);
+    int copy(int srcParent, const std::string& srcName, int dstParent, const std::string& dstName);
     bool createdRoot() const { return createdRoot_; }
 
   private:
+    // Copies one item; a directory is entered (its level pushed), its
+    // contents copied by the caller's loop.
+    int copyEntry(int srcParent, const std::string& srcName, int dstParent,
+                  const std::string& dstName, bool isRoot);
     int copyFile(int srcParent, const char* srcName, int dstParent, const char* dstName,
                  const struct stat& st, bool isRoot);
-    int copyDirectory(int srcParent, const char* srcName, int dstParent, const char* dstName,
-                      const struct stat& st, bool isRoot);
+    int enterDirectory(int srcParent, const char* srcName, int dstParent, const char* dstName,
+                       const struct stat& st, bool isRoot);
+    // The directory's attributes, once its contents are in; then back to its
+    // parent, opened again if it was parked.
+    int leaveDirectory();
     int copyLink(int srcParent, const char* srcName, int dstParent, const char* dstName,
                  const struct stat& st, bool isRoot);
     int copySpecial(int dstParent, const char* dstName, const struct stat& st, bool isRoot);
@@ -116,6 +169,8 @@ class Copier {
     // Makes room for a new non-directory: a non-directory in the way goes.
     static int clearWay(int dstParent, const char* dstName);
 
+    // The directories being copied, outermost first.
+    std::vector<Level> levels_;
     // Directories this copy made: met again in the source (a copy into
     // itself), they are not copied again.
     std::set<std::pair<dev_t, ino_t>> made_;
@@ -129,6 +184,22 @@ int Copier::clearWay(int dstParent, const char* dstName) {
     return ::unlinkat(dstParent, dstName, 0) == 0 ? 0 : errno;
 }
 
+int Copier::copy(int srcParent, const std::string& srcName, int dstParent,
+                 const std::string& dstName) {
+    if (int err = copyEntry(srcParent, srcName, dstParent, dstName, true)) return err;
+    while (!levels_.empty()) {
+        Level& level = levels_.back();
+        if (level.next == level.names.size()) {
+            if (int err = leaveDirectory()) return err;
+            continue;
+        }
+        // Taken out, as entering a directory grows the stack under `level`.
+        const std::string name = std::move(level.names[level.next++]);
+        if (int err = copyEntry(level.src.get(), name, level.dst.get(), name, false)) return err;
+    }
+    return 0;
+}
+
 int Copier::copyEntry(int srcParent, const std::string& srcName, int dstParent,
                       const std::string& dstName, bool isRoot) {
     const char* sname = srcName.c_str();
@@ -140,7 +211,7 @@ int Copier::copyEntry(int srcParent, const std::string& srcName, int dstParent,
         if (S_ISREG(st.st_mode))
             err = copyFile(srcParent, sname, dstParent, dname, st, isRoot);
         else if (S_ISDIR(st.st_mode))
-            err = copyDirectory(srcParent, sname, dstParent, dname, st, isRoot);
+            err = enterDirectory(srcParent, sname, dstParent, dname, st, isRoot);
         else if (S_ISLNK(st.st_mode))
             err = copyLink(srcParent, sname, dstParent, dname, st, isRoot);
         else
@@ -167,37 +238,44 @@ int Copier::copyFile(int srcParent, const char* srcName, int dstParent, const ch
     return copyMetadata(from.get(), to.get(), st);
 }
 
-int Copier::copyDirectory(int srcParent, const char* srcName, int dstParent, const char* dstName,
-                          const struct stat& st, bool isRoot) {
+int Copier::enterDirectory(int srcParent, const char* srcName, int dstParent, const char* dstName,
+                           const struct stat& st, bool isRoot) {
     if (made_.count({st.st_dev, st.st_ino})) return 0;
-    UniqueFd from = openDirectoryChecked(srcParent, srcName, st);
-    if (!from) return errno;
+    Level level;
+    level.src = openDirectoryChecked(srcParent, srcName, st);
+    if (!level.src) return errno;
+    level.srcSt = st;
     // Made private to root until its contents and attributes are in.
     if (::mkdirat(dstParent, dstName, 0700) == 0) {
         if (isRoot) createdRoot_ = true;
     } else if (errno != EEXIST) {
         return errno;
     }
-    UniqueFd to = openAtNoFollow(dstParent, dstName, O_RDONLY | O_DIRECTORY);
-    if (!to) return errno == ELOOP || errno == ENOTDIR ? EEXIST : errno;
-    struct stat made;
-    if (::fstat(to.get(), &made) != 0) return errno;
-    made_.insert({made.st_dev, made.st_ino});
-
-    std::vector<std::string> names;
+    level.dst = openAtNoFollow(dstParent, dstName, O_RDONLY | O_DIRECTORY);
+    if (!level.dst) return errno == ELOOP || errno == ENOTDIR ? EEXIST : errno;
+    if (::fstat(level.dst.get(), &level.dstSt) != 0) return errno;
+    made_.insert({level.dstSt.st_dev, level.dstSt.st_ino});
     {
-        DirReader reader(from.get());
+        DirReader reader(level.src.get());
         if (!reader.valid()) return errno;
-        while (const struct dirent* entry = reader.next()) names.emplace_back(entry->d_name);
+        while (const struct dirent* entry = reader.next()) level.names.emplace_back(entry->d_name);
         if (errno != 0) return errno;
     }
-    for (const std::string& name : names)
-        if (int err = copyEntry(from.get(), name, to.get(), name, false)) {
-            // A child that changed kind under us is this directory's business
-            // no more: report it as a plain failure, not as a change here.
-            return changedSinceLstat(err) ? EAGAIN : err;
-        }
-    return copyMetadata(from.get(), to.get(), st);
+    levels_.push_back(std::move(level));
+    if (levels_.size() > kOpenLevels) levels_[levels_.size() - 1 - kOpenLevels].park();
+    return 0;
+}
+
+int Copier::leaveDirectory() {
+    Level& level = levels_.back();
+    if (int err = copyMetadata(level.src.get(), level.dst.get(), level.srcSt)) return err;
+    if (levels_.size() > 1) {
+        Level& parent = levels_[levels_.size() - 2];
+        if (!parent.isOpen())
+            if (int err = parent.unpark(level)) return err;
+    }
+    levels_.pop_back();
+    return 0;
 }
 
 int Copier::copyLink(int srcParent, const char* srcName, int dstParent, const char* dstName,
@@ -236,7 +314,7 @@ int copyTree(const std::filesystem::path& source, const std::filesystem::path& d
     UniqueFd dstParent = openParentNoFollow(dest, &dstName);
     if (!dstParent) return errno;
     Copier copier;
-    const int err = copier.copyEntry(srcParent.get(), srcName, dstParent.get(), dstName, true);
+    const int err = copier.copy(srcParent.get(), srcName, dstParent.get(), dstName);
     if (err != 0 && copier.createdRoot()) removeTree(dest);
     return err;
 }

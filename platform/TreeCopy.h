@@ -12,6 +12,14 @@
 // set last. Special files (fifos, sockets, devices) are made anew with their
 // mode, owner and times. A destination item in the way is replaced, except a
 // directory, which is merged into.
+//
+// The copy holds a bounded number of descriptors, and a bounded stack,
+// whatever the depth of the tree: only the innermost directories of the
+// source and the destination stay open; a level further up has its names
+// read in advance and is closed, and on the way back both directories are
+// reached again as their child's "..", which must be the very directory left
+// (a directory moved meanwhile ends the copy with ESTALE rather than lead it
+// somewhere else).
 #pragma once
 
 #include <filesystem>

@@ -1,8 +1,11 @@
 // Copies and same-volume moves: what a copy keeps, missing sources, error
-// texts, and a source tree whose app swaps a subdirectory for a link while
-// it is being copied.
+// texts, a source tree whose app swaps a subdirectory for a link while it is
+// being copied, chains deeper than the descriptor limit, and a directory
+// moved away above the levels the copy holds open.
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/acl.h>
+#include <sys/fanotify.h>
 #include <sys/xattr.h>
 
 #include <sstream>
@@ -239,6 +242,116 @@ TEST(BTHFileManagerCopy, ASubdirectorySwappedForALinkMidCopyIsCopiedAsALink) {
         stdfs::remove_all(dest, ec);
     }
     RecordProperty("LinksCopied", linksCopied);
+}
+
+// Walks two directory chains side by side, one level at a time through
+// descriptors (no path would reach their bottom), and tells how deep they
+// are alike: same mode, owner and modification time, a file "f" at the same
+// levels. Stops at the first level that differs or has no "d" below it.
+int alikeLevels(const stdfs::path& one, const stdfs::path& other, int* filesSeen) {
+    UniqueFd a(::open(one.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    UniqueFd b(::open(other.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    *filesSeen = 0;
+    for (int level = 0;; ++level) {
+        struct stat sa, sb, fa, fb;
+        if (!a || !b || ::fstat(a.get(), &sa) != 0 || ::fstat(b.get(), &sb) != 0) return level - 1;
+        if (sa.st_mode != sb.st_mode || sa.st_uid != sb.st_uid ||
+            sa.st_mtim.tv_sec != sb.st_mtim.tv_sec || sa.st_mtim.tv_nsec != sb.st_mtim.tv_nsec)
+            return level - 1;
+        const bool fileA = ::fstatat(a.get(), "f", &fa, AT_SYMLINK_NOFOLLOW) == 0;
+        const bool fileB = ::fstatat(b.get(), "f", &fb, AT_SYMLINK_NOFOLLOW) == 0;
+        if (fileA != fileB || (fileB && !S_ISREG(fb.st_mode))) return level - 1;
+        *filesSeen += fileB;
+        a = UniqueFd(::openat(a.get(), "d", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        b = UniqueFd(::openat(b.get(), "d", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (!a && !b) return level;
+    }
+}
+
+// An app can nest its directories deeper than the daemon has descriptors:
+// the copy still takes the whole chain, each directory with its attributes
+// (applied after its contents), and holds few descriptors at any depth.
+TEST(BTHFileManagerCopy, ChainsDeeperThanTheDescriptorLimitAreCopiedWhole) {
+    ScratchDir dir;
+    const stdfs::path source = dir / "deep", dest = dir / "copy";
+    stdfs::create_directories(source);
+    constexpr int kDepth = 1500;  // a copy holding each level open needs over 3,000
+    makeDirectoryChain(source, kDepth, 500);
+
+    const int idle = openDescriptorCount();
+    std::atomic<bool> copying{true};
+    std::atomic<int> most{idle};
+    BTHErrorRef error;
+    bool copied = false;
+    {
+        DescriptorLimit tight(200);
+        std::thread watcher([&] {
+            while (copying) {
+                most = std::max(most.load(), openDescriptorCount());
+                std::this_thread::sleep_for(std::chrono::microseconds(200));
+            }
+        });
+        copied = manager().copyItemAtURL(source, dest, &error);
+        copying = false;
+        watcher.join();
+    }
+    ASSERT_TRUE(copied) << (error ? error->description() : "");
+    int files = 0;
+    EXPECT_EQ(alikeLevels(source, dest, &files), kDepth);
+    EXPECT_EQ(files, kDepth / 500);
+    EXPECT_LT(most - idle, 100) << "descriptors held during the copy";
+    EXPECT_EQ(openDescriptorCount(), idle);
+}
+
+// Coming back up through levels it no longer holds open, the copy reaches
+// each again through its child; a source directory moved elsewhere meanwhile
+// leads to another directory, and the copy ends instead of going on there,
+// taking away the destination it made. The copy is held at the bottom of the
+// chain (its opening of the file there waits for an answer) while the app
+// moves a directory far above.
+TEST(BTHFileManagerCopy, ASourceDirectoryMovedAwayAboveTheOpenLevelsEndsTheCopy) {
+    BERTH_REQUIRE_ROOT();
+    ScratchDir dir;
+    const stdfs::path source = dir / "deep", dest = dir / "copy";
+    stdfs::create_directories(source);
+    stdfs::create_directories(dir / "elsewhere");
+    makeDirectoryChain(source, 200);
+    stdfs::path level50 = source;
+    for (int i = 0; i < 50; ++i) level50 /= "d";
+    stdfs::path bottom = level50;
+    for (int i = 50; i < 200; ++i) bottom /= "d";
+    writeFile(bottom / "f", "bottom");
+    const stdfs::path moved = dir / "elsewhere" / "d";
+
+    UniqueFd watch(::fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDONLY));
+    ASSERT_TRUE(watch) << std::strerror(errno);
+    ASSERT_EQ(
+        ::fanotify_mark(watch.get(), FAN_MARK_ADD, FAN_OPEN_PERM, AT_FDCWD, (bottom / "f").c_str()),
+        0)
+        << std::strerror(errno);
+    std::atomic<bool> movedMeanwhile{false};
+    std::thread app([&] {
+        struct pollfd ready = {watch.get(), POLLIN, 0};
+        if (::poll(&ready, 1, 30000) != 1) return;  // the copy never got there
+        struct fanotify_event_metadata event {};
+        if (::read(watch.get(), &event, sizeof event) != sizeof event) return;
+        UniqueFd opened(event.fd);
+        std::error_code ec;
+        stdfs::rename(level50, moved, ec);
+        movedMeanwhile = !ec;
+        const struct fanotify_response answer = {event.fd, FAN_ALLOW};
+        EXPECT_EQ(::write(watch.get(), &answer, sizeof answer), ssize_t(sizeof answer));
+    });
+    BTHErrorRef error;
+    const bool copied = manager().copyItemAtURL(source, dest, &error);
+    app.join();
+    watch.reset();  // no more opening held
+    ASSERT_TRUE(movedMeanwhile);
+    EXPECT_FALSE(copied) << "the copy went on above the moved directory";
+    expectPOSIXError(error, ESTALE);
+    EXPECT_FALSE(stdfs::exists(stdfs::symlink_status(dest)));
+    // The source is where the app left it, untouched.
+    EXPECT_EQ(readFile(moved / bottom.lexically_relative(level50) / "f"), "bottom");
 }
 
 }  // namespace
