@@ -324,11 +324,10 @@ TEST(BTHFileManagerCopy, ASourceDirectoryMovedAwayAboveTheOpenLevelsEndsTheCopy)
     const stdfs::path moved = dir / "elsewhere" / "d";
 
     UniqueFd watch(::fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDONLY));
-    ASSERT_TRUE(watch) << std::strerror(errno);
-    ASSERT_EQ(
-        ::fanotify_mark(watch.get(), FAN_MARK_ADD, FAN_OPEN_PERM, AT_FDCWD, (bottom / "f").c_str()),
-        0)
-        << std::strerror(errno);
+    if (!watch || ::fanotify_mark(watch.get(), FAN_MARK_ADD, FAN_OPEN_PERM, AT_FDCWD,
+                                  (bottom / "f").c_str()) != 0)
+        GTEST_SKIP() << "the kernel cannot hold a file's opening (file-access permission events): "
+                     << std::strerror(errno);
     std::atomic<bool> movedMeanwhile{false};
     std::thread app([&] {
         struct pollfd ready = {watch.get(), POLLIN, 0};
