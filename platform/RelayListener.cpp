@@ -174,11 +174,10 @@ std::unique_ptr<RelayListener> RelayListener::make(UniqueFd socket,
     if (!poller) return nullptr;
     auto acceptor =
         std::make_shared<Acceptor>(std::move(socket), std::move(queue), std::move(options), poller);
-    return std::unique_ptr<RelayListener>(
-        new RelayListener(std::move(poller), std::move(acceptor)));
+    return std::make_unique<RelayListener>(Passkey{}, std::move(poller), std::move(acceptor));
 }
 
-RelayListener::RelayListener(std::shared_ptr<RelayPoller> poller,
+RelayListener::RelayListener(Passkey, std::shared_ptr<RelayPoller> poller,
                              std::shared_ptr<Acceptor> acceptor)
     : poller_(std::move(poller)), acceptor_(std::move(acceptor)) {}
 

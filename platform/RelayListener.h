@@ -34,6 +34,9 @@
 namespace berth {
 
 class RelayListener {
+    class Acceptor;
+    struct Passkey {};
+
   public:
     struct Options {
         // Names the threads, queues and log lines of the listener.
@@ -55,6 +58,9 @@ class RelayListener {
     static std::unique_ptr<RelayListener> make(UniqueFd socket, std::shared_ptr<WorkQueue> queue,
                                                Options options, std::string* why = nullptr);
 
+    // Made by make() only.
+    RelayListener(Passkey, std::shared_ptr<RelayPoller> poller, std::shared_ptr<Acceptor> acceptor);
+
     // Stops accepting, ends every connection it accepted and stops the I/O
     // thread. Events already queued are still delivered.
     ~RelayListener();
@@ -71,10 +77,6 @@ class RelayListener {
     size_t connectionCount() const;
 
   private:
-    class Acceptor;
-
-    RelayListener(std::shared_ptr<RelayPoller> poller, std::shared_ptr<Acceptor> acceptor);
-
     std::shared_ptr<RelayPoller> poller_;
     std::shared_ptr<Acceptor> acceptor_;
 };

@@ -16,7 +16,7 @@ constexpr int kEventsPerWait = 64;
 }  // namespace
 
 std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, std::string* why) {
-    std::shared_ptr<RelayPoller> poller(new RelayPoller());
+    auto poller = std::make_shared<RelayPoller>(Passkey{});
     poller->epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
     poller->wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     epoll_event event{};

@@ -22,7 +22,12 @@
 namespace berth {
 
 class RelayPoller {
+    struct Passkey {};
+
   public:
+    // Made by start() only.
+    explicit RelayPoller(Passkey) {}
+
     class Watcher {
       public:
         virtual ~Watcher() = default;
@@ -60,7 +65,6 @@ class RelayPoller {
     bool isPollerThread() const { return std::this_thread::get_id() == thread_.get_id(); }
 
   private:
-    RelayPoller() = default;
     void run();
 
     UniqueFd epoll_;

@@ -115,10 +115,10 @@ std::unique_ptr<BerthConnection> BerthConnection::connect(const std::filesystem:
         return nullptr;
     }
     ::fcntl(fd.get(), F_SETFL, ::fcntl(fd.get(), F_GETFL) | O_NONBLOCK);
-    return std::unique_ptr<BerthConnection>(new BerthConnection(std::move(fd)));
+    return std::make_unique<BerthConnection>(Passkey{}, std::move(fd));
 }
 
-BerthConnection::BerthConnection(UniqueFd socket) : socket_(std::move(socket)) {
+BerthConnection::BerthConnection(Passkey, UniqueFd socket) : socket_(std::move(socket)) {
     reader_ = std::thread([this] { readReplies(); });
 }
 

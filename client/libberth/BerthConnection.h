@@ -59,7 +59,12 @@ struct BerthError {
 const char* describe(BerthError::Code code);
 
 class BerthConnection {
+    struct Passkey {};
+
   public:
+    // Made by connect() only.
+    BerthConnection(Passkey, UniqueFd socket);
+
     // <BERTH_ROOT>/run/berthd/sys.kelp.berthd
     static std::filesystem::path defaultSocketPath();
 
@@ -95,8 +100,6 @@ class BerthConnection {
         std::optional<Value> reply;
         bool done = false;
     };
-
-    explicit BerthConnection(UniqueFd socket);
 
     // Writes one whole frame before `deadline`.
     bool write(const std::vector<uint8_t>& frame, std::chrono::steady_clock::time_point deadline,
