@@ -119,8 +119,12 @@ PROGRAM
     libdir=$(dirname "$(find "$stage_dir" -name 'libberth.so')")
     [[ $(LD_LIBRARY_PATH=$libdir "$scratch/client" "$scratch/nothing") == "not running" ]] ||
         fail "the program linked with libberth does not run"
-    LD_LIBRARY_PATH=$libdir ldd "$scratch/client" | grep -q "libberth.so.0 => $libdir" ||
-        fail "the program does not use the installed shared libberth"
+    # Whole output first: grep -q stopping early would kill ldd with SIGPIPE,
+    # which pipefail counts as a failure.
+    local linked
+    linked=$(LD_LIBRARY_PATH=$libdir ldd "$scratch/client")
+    grep -q "libberth.so.0 => $libdir" <<<"$linked" ||
+        fail "the program does not use the installed shared libberth: $linked"
 }
 
 check_package() {
