@@ -50,7 +50,6 @@
 #include "BenchLatency.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
-#include "platform/NamedSemaphore.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -259,25 +258,6 @@ int main(int argc, char** argv) {
         return 64;
     }
 
-    char scratch[] = "/tmp/container-bench.XXXXXX";
-    if (!::mkdtemp(scratch)) {
-        std::perror("mkdtemp");
-        return 1;
-    }
-    // The daemon modules this program uses read the device root once, from
-    // here: set it before any of them runs.
-    const std::filesystem::path root = std::filesystem::path(scratch) / "root";
-    ::setenv("BERTH_ROOT", root.c_str(), 1);
-    int status = 0;
-    try {
-        run(settings, root);
-    } catch (const std::exception& e) {
-        std::fprintf(stderr, "container_bench: %s (the device root stays at %s)\n", e.what(),
-                     root.c_str());
-        status = 1;
-    }
-    NamedSemaphore::remove("berthd.fb_check");  // the scratch root's first-boot marker
-    std::error_code ignored;
-    if (status == 0) std::filesystem::remove_all(scratch, ignored);
-    return status;
+    return bench::runOnScratchRoot("container-bench",
+                                   [&](const std::filesystem::path& root) { run(settings, root); });
 }

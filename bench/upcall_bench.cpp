@@ -28,7 +28,6 @@
 #include "BenchDaemon.h"
 #include "BenchLatency.h"
 #include "packbuff/packbuff.h"
-#include "platform/NamedSemaphore.h"
 #include "platform/UpcallTransport.h"
 
 namespace berth {
@@ -147,25 +146,6 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "upcall_bench: seconds must be positive\n");
         return 64;
     }
-    char scratch[] = "/tmp/upcall-bench.XXXXXX";
-    if (!::mkdtemp(scratch)) {
-        std::perror("mkdtemp");
-        return 1;
-    }
-    // The daemon modules this program uses read the device root once, from
-    // here: set it before any of them runs.
-    const std::filesystem::path root = std::filesystem::path(scratch) / "root";
-    ::setenv("BERTH_ROOT", root.c_str(), 1);
-    int status = 0;
-    try {
-        run(berthd, root, seconds);
-    } catch (const std::exception& e) {
-        std::fprintf(stderr, "upcall_bench: %s (the device root stays at %s)\n", e.what(),
-                     root.c_str());
-        status = 1;
-    }
-    NamedSemaphore::remove("berthd.fb_check");
-    std::error_code ignored;
-    if (status == 0) std::filesystem::remove_all(scratch, ignored);
-    return status;
+    return bench::runOnScratchRoot(
+        "upcall-bench", [&](const std::filesystem::path& root) { run(berthd, root, seconds); });
 }

@@ -29,7 +29,6 @@
 #include <vector>
 
 #include "BenchDaemon.h"
-#include "platform/NamedSemaphore.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -210,23 +209,6 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "usage_bench: files, directories and rounds must be positive\n");
         return 64;
     }
-    char scratch[] = "/tmp/usage-bench.XXXXXX";
-    if (!::mkdtemp(scratch)) {
-        std::perror("mkdtemp");
-        return 1;
-    }
-    const std::filesystem::path root = std::filesystem::path(scratch) / "root";
-    ::setenv("BERTH_ROOT", root.c_str(), 1);
-    int status = 0;
-    try {
-        run(settings, root);
-    } catch (const std::exception& e) {
-        std::fprintf(stderr, "usage_bench: %s (the device root stays at %s)\n", e.what(),
-                     root.c_str());
-        status = 1;
-    }
-    NamedSemaphore::remove("berthd.fb_check");
-    std::error_code ignored;
-    if (status == 0) std::filesystem::remove_all(scratch, ignored);
-    return status;
+    return bench::runOnScratchRoot("usage-bench",
+                                   [&](const std::filesystem::path& root) { run(settings, root); });
 }

@@ -21,21 +21,6 @@ constexpr const char* kStageFunction =
     "-[BTHClientConnection "
     "stageForDeleteContainersWithUsers:UUIDs:identifiers:classes:useLocking:withError:]";
 
-bool isDataClass(uint64_t containerClass) {
-    switch (containerClass) {
-        case 2:
-        case 4:
-        case 6:
-        case 7:
-        case 9:
-        case 10:
-        case 11:
-            return true;
-        default:
-            return false;
-    }
-}
-
 }  // namespace
 
 BTHErrorRef BTHClientConnection::stageOneForDelete(uid_t userId, const std::optional<Uuid>& uuid,
@@ -160,7 +145,7 @@ void BTHClientConnection::deleteDataContainerContentForUser(
                 result = BTHErrorIdentifierMissing;
                 return nullptr;
             }
-            if (!isDataClass(containerClass)) {
+            if (!BTHContainerClassIsData(containerClass)) {
                 BTHLogError(
                     "Can't wipe container non-data container of type: %llu, identifier: %@, "
                     "userId: %u",

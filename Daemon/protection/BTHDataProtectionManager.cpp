@@ -16,21 +16,6 @@ namespace {
 
 constexpr const char* kContentProtectionClassKey = "sys.kelp.Lading.ContentProtectionClass";
 
-bool isDataClass(uint64_t containerClass) {
-    switch (containerClass) {
-        case 2:
-        case 4:
-        case 6:
-        case 7:
-        case 9:
-        case 10:
-        case 11:
-            return true;
-        default:
-            return false;
-    }
-}
-
 int32_t currentClassOf(const BTHMetadata& container) {
     const Value* stored =
         container.info() ? container.info()->find(kContentProtectionClassKey) : nullptr;
@@ -98,7 +83,7 @@ void BTHDataProtectionManager::setDataProtectionOnDataContainerForUser(
         "isSecondOrThirdPartyApp:retryIfLocked:withCompletion:]");
     std::shared_ptr<BTHDataProtectionChangeOperation> operation;
     const BTHErrorRef refusal = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&] {
-        if (!identifier || !isDataClass(containerClass)) {
+        if (!identifier || !BTHContainerClassIsData(containerClass)) {
             return BTHMakeError(BTHErrorInvalidArgument, nullptr,
                                 "Can't act on an invalid object: userId: %u, ID: %@, class: %ld",
                                 userId, identifier, containerClass);

@@ -8,6 +8,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <stdexcept>
@@ -128,6 +130,29 @@ void BenchDaemon::stop() {
     std::error_code ignored;
     fs::remove(socket_, ignored);               // the next start must not find it early
     NamedSemaphore::remove("berthd.fb_check");  // the scratch root's marker
+}
+
+int runOnScratchRoot(const char* name,
+                     const std::function<void(const std::filesystem::path&)>& body) {
+    std::string scratch = std::string("/tmp/") + name + ".XXXXXX";
+    if (!::mkdtemp(scratch.data())) {
+        std::perror("mkdtemp");
+        return 1;
+    }
+    const std::filesystem::path root = std::filesystem::path(scratch) / "root";
+    ::setenv("BERTH_ROOT", root.c_str(), 1);
+    int status = 0;
+    try {
+        body(root);
+    } catch (const std::exception& e) {
+        std::fprintf(stderr, "%s: %s (the device root stays at %s)\n", name, e.what(),
+                     root.c_str());
+        status = 1;
+    }
+    NamedSemaphore::remove("berthd.fb_check");  // the scratch root's first-boot marker
+    std::error_code ignored;
+    if (status == 0) std::filesystem::remove_all(scratch, ignored);
+    return status;
 }
 
 }  // namespace berth::bench

@@ -9,6 +9,7 @@
 #include <chrono>
 #include <cstdint>
 #include <filesystem>
+#include <functional>
 #include <optional>
 #include <string>
 #include <vector>
@@ -22,6 +23,13 @@ namespace berth::bench {
 // this program into the root's registry as `identifier` with `entitlements`.
 void prepareBenchRoot(const std::filesystem::path& root, const std::string& identifier,
                       const Value& entitlements);
+
+// Makes a scratch directory named after `name`, points BERTH_ROOT at its
+// "root" (the daemon modules a benchmark uses read it once: call this before
+// any of them runs) and runs `body` with that root. A failure is printed and
+// leaves the root in place for a look; success removes it. The exit status.
+int runOnScratchRoot(const char* name,
+                     const std::function<void(const std::filesystem::path&)>& body);
 
 // One connection speaking the relay synchronously: a request, then its
 // reply. A reply slower than `patience` counts as a broken connection.

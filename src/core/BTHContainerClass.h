@@ -62,6 +62,11 @@ inline constexpr bool BTHContainerClassIsGlobal(uint64_t c) {
 inline constexpr bool BTHContainerClassIsPerUser(uint64_t c) {
     return BTHContainerClassIsValid(c) && !BTHContainerClassIsGlobal(c);
 }
+// The classes holding an app's, plug-in's, group's or service's data (not a
+// bundle, not a system container).
+inline constexpr bool BTHContainerClassIsData(uint64_t c) {
+    return c == 2 || c == 4 || c == 6 || c == 7 || c == 9 || c == 10 || c == 11;
+}
 
 // The file inside every container that holds its metadata record. The file
 // operations leave it alone when they standardize a container's contents, so
