@@ -131,6 +131,18 @@ std::shared_ptr<BTHLogHandle> BTHLogGetHandle() {
     return handleSlot().load();
 }
 
+namespace {
+std::atomic<uint32_t> gLogFileCount{1};
+}  // namespace
+
+uint32_t BTHLogFileCount() {
+    return gLogFileCount.load(std::memory_order_relaxed);
+}
+
+void BTHSetLogFileCount(uint32_t count) {
+    gLogFileCount.store(count, std::memory_order_relaxed);
+}
+
 void BTHLogSetHandle(std::shared_ptr<BTHLogHandle> handle) {
     handleSlot().store(std::move(handle));
 }

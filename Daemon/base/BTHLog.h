@@ -104,6 +104,12 @@ void BTHLogWriteWithCode(int level, std::string_view function, std::string_view 
 std::shared_ptr<BTHLogHandle> BTHLogGetHandle();
 void BTHLogSetHandle(std::shared_ptr<BTHLogHandle> handle);
 
+// The number of rotated log files the daemon keeps: 1, or 4 on internal
+// builds. Set when the log is opened at start-up; the migration of old log
+// files reads it.
+uint32_t BTHLogFileCount();
+void BTHSetLogFileCount(uint32_t count);
+
 // The guard of every log call: true when a line of `level` is written.
 bool BTHLogEnabled(int level);
 

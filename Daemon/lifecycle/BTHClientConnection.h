@@ -232,7 +232,24 @@ class BTHClientConnection {
     // death row emptied.
     void berthCleanup();
 
+    // ----- First start after boot (BTHClientConnection+FirstBoot.cpp)
+
+    // Transient containers of every kind to death row, then whatever is not
+    // a container in the container directories of the current user (data
+    // and group classes), of user 33 (bundle classes) and of user 499
+    // (system classes). Death row is emptied by the cleanup that follows.
+    void rebootBerthCleanup();
+    // Every item of the class directory that is not named like a container
+    // of the class, or is so named but holds no metadata file, to death row.
+    void _cleanupOrphanedDataForUser(uid_t userId, uint64_t containerClass);
+    // The retry test: stores the countdown in the info of the container
+    // "sys.kelp.retryTest" and, while it is above 0, ends the process with
+    // status 0 two seconds later (the request gets no reply). At 0 the
+    // container is staged for deletion and `error` gets 1.
+    void retryTestForUser(uid_t userId, uint64_t numCrashes, uint64_t* error);
+
   private:
+    uint64_t runRetryTest(uid_t userId, uint64_t numCrashes);
     BTHErrorRef stageOneForDelete(uid_t userId, const std::optional<Uuid>& uuid,
                                   const std::optional<std::string>& identifier,
                                   const Value& classValue);

@@ -4,6 +4,7 @@
 #include "BTHContainerCommands.h"
 #include "BTHError.h"
 #include "BTHGroupCommands.h"
+#include "BTHMaintenanceCommands.h"
 #include "BTHProtectionCommands.h"
 #include "BTHSharedContentCommands.h"
 #include "BTHUsageCommands.h"
@@ -49,6 +50,8 @@ constexpr struct {
     {21, setDataProtection},
     {22, recreateDefaultStructure},
     {23, diskUsage},
+    {24, performDataMigration},
+    {25, retryTest},
     {26, stageSharedContent},
     {27, setNetworkExtension},
     {28, userManagedAssetsPath},

@@ -19,6 +19,7 @@
 #include "BTHClientConnection.h"
 #include "BTHCodeSigningMapping.h"
 #include "BTHError.h"
+#include "BTHFirstBootSetup.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHGroupManager.h"
 #include "BTHLockStateCallback.h"
@@ -41,8 +42,6 @@
 namespace berth {
 
 namespace {
-
-std::atomic<uint32_t> gLogFileCount{1};
 
 // A positive count from the service's environment, else `fallback`.
 size_t limitFromEnvironment(const char* name, size_t fallback) {
@@ -84,7 +83,7 @@ void openRotatingLog() {
     const bool internal = DeviceProperties::isInternalBuild();
     const uint32_t count = internal ? kInternalLogFileCount : kLogFileCount;
     const uint64_t limit = internal ? kInternalLogSizeLimit : kLogSizeLimit;
-    gLogFileCount = count;
+    BTHSetLogFileCount(count);
     auto handle = std::make_shared<BTHLogHandle>(kBTHServiceName, BTHLogLevelNotice);
     // Under the service manager the journal gets every line too; the
     // rotating file stays the record the device keeps.
@@ -204,10 +203,6 @@ void warnIfAppsCanBeAttached() {
 
 }  // namespace
 
-uint32_t BTHLogFileCount() {
-    return gLogFileCount;
-}
-
 int BTHDaemonMain() {
     BTH_FUNCTION("main");
     // Every thread made from here on inherits the blocked SIGTERM, so the
@@ -231,14 +226,14 @@ int BTHDaemonMain() {
     connectCodeSigningConsequences();
     warnIfAppsCanBeAttached();
 
+    const std::shared_ptr<BTHClientConnection>& daemonClient =
+        BTHClientConnection::sharedClientConnection();
     const bool firstBoot = !NamedSemaphore::exists(kBTHFirstBootSemaphoreName);
     if (firstBoot) {
         BTHLogNotice("berthd performing first boot initialization");
-        // The once-per-boot setup of the container store runs here once the
-        // store's maintenance operations are built into the daemon.
+        ServiceManager::notifyStatus("Migrating after boot");
+        BTHRebootBerthSetup(*daemonClient);
     }
-    const std::shared_ptr<BTHClientConnection>& daemonClient =
-        BTHClientConnection::sharedClientConnection();
     ServiceManager::notifyStatus("Recovering interrupted replaces");
     daemonClient->berthSetup();
 
@@ -253,6 +248,8 @@ int BTHDaemonMain() {
     registerForLockStateChanges(runLoop);
 
     if (firstBoot) {
+        ServiceManager::notifyStatus("Cleaning up after boot");
+        daemonClient->rebootBerthCleanup();
         BTHLogNotice("berthd first boot cleanup complete");
         setFirstBootWorkCompleted();
     }

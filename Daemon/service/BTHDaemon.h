@@ -23,7 +23,4 @@ inline constexpr const char* kBTHFirstBootSemaphoreName = "berthd.fb_check";
 // main run loop forever.
 int BTHDaemonMain();
 
-// The number of rotated log files kept: 1, or 4 on internal builds.
-uint32_t BTHLogFileCount();
-
 }  // namespace berth

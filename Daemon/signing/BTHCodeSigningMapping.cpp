@@ -1,7 +1,9 @@
 #include "BTHCodeSigningMapping.h"
 
 #include <cerrno>
+#include <cstring>
 
+#include "BTHFaultInjection.h"
 #include "BTHGlobalConfiguration.h"
 #include "BTHLog.h"
 #include "BTHPropertyListFile.h"
@@ -82,7 +84,10 @@ BTHErrorRef BTHCodeSigningMapping::writeCodeSigningMappingToDisk() {
         if (entry) serialized.set(identifier, entry->serialize());
     const std::filesystem::path url = mappingFileURL();
     BTHErrorRef writeError;
-    if (BTH_writeToURL(serialized, url, kBTHStateFileWriteOptions, &writeError)) return nullptr;
+    if (BTHFaultActive("mapping.write"))
+        writeError = BTHMakePOSIXError(EIO, "write of %@ failed: %s", url, strerror(EIO));
+    else if (BTH_writeToURL(serialized, url, kBTHStateFileWriteOptions, &writeError))
+        return nullptr;
     return BTHMakeError(BTHErrorMappingWriteFailed, writeError,
                         "Failed to write entitlement mapping file at %@ : %@", url,
                         describedMapping(codeSigningMappingDict_));
@@ -128,6 +133,13 @@ BTHErrorRef BTHCodeSigningMapping::setCodeSigningDictionaryValues(
 const BTHCodeSigningEntry* BTHCodeSigningMapping::storedEntry(const std::string& identifier) const {
     auto stored = codeSigningMappingDict_.find(identifier);
     return stored == codeSigningMappingDict_.end() ? nullptr : stored->second.get();
+}
+
+void BTHCodeSigningMapping::performExclusively(const std::function<void()>& work) {
+    lockingAll([&] {
+        work();
+        return true;
+    });
 }
 
 }  // namespace berth

@@ -124,6 +124,12 @@ class BTHCodeSigningMapping {
     // the in-memory mapping stays as it is).
     BTHErrorRef writeCodeSigningMappingToDisk();
 
+    // Runs `work` with the mapping to itself: under the all-identifiers lock
+    // held for writing (when connected) and on the code-signing queue, so
+    // neither processing nor a query sees the mapping half changed. For
+    // maintenance that edits codeSigningMappingDict() directly.
+    void performExclusively(const std::function<void()>& work);
+
     // Connects the consequences that belong to the layers above the store
     // (start-up, before the first request; tests, before they process).
     void setHooks(BTHCodeSigningHooks hooks) { hooks_ = std::move(hooks); }

@@ -15,6 +15,8 @@
 #include <sstream>
 
 #include "BTHLog.h"
+#include "BTHPropertyListFile.h"
+#include "platform/DeviceRoot.h"
 #include "platform/UniqueFd.h"
 
 namespace berth::test {
@@ -114,6 +116,13 @@ void writeFile(const std::filesystem::path& path, const std::string& text) {
     std::ofstream out(path, std::ofstream::binary | std::ofstream::trunc);
     out << text;
     if (!out) throw std::runtime_error("cannot write " + path.string());
+}
+
+void writeDeviceProperties(const Value& properties) {
+    const std::filesystem::path url = DeviceRoot::resolve("/etc/berthd/DeviceProperties.plist");
+    std::filesystem::create_directories(url.parent_path());
+    if (!BTH_writeToURL(properties, url, 0, nullptr))
+        throw std::runtime_error("cannot write " + url.string());
 }
 
 std::string readFile(const std::filesystem::path& path) {

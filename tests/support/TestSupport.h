@@ -76,6 +76,9 @@ class LogCapture {
 // Writes `text` to `path`, creating or replacing it.
 void writeFile(const std::filesystem::path& path, const std::string& text);
 std::string readFile(const std::filesystem::path& path);
+// Replaces the device-property file of the device root with `properties`
+// ("InternalBuild", "MultiUser", ...).
+void writeDeviceProperties(const Value& properties);
 
 // Sets or clears the immutable flag of `path` (not following a link).
 bool setImmutable(const std::filesystem::path& path, bool on);

@@ -20,9 +20,7 @@ using test::dict;
 [[maybe_unused]] const auto& kRoot = test::installScratchDeviceRoot();
 
 void setInternalBuild(bool internal) {
-    const stdfs::path url = DeviceRoot::resolve("/etc/berthd/DeviceProperties.plist");
-    stdfs::create_directories(url.parent_path());
-    ASSERT_TRUE(BTH_writeToURL(dict({{"InternalBuild", internal}}), url, 0, nullptr));
+    test::writeDeviceProperties(dict({{"InternalBuild", internal}}));
 }
 
 class BTHNetworkExtensionTest : public ::testing::Test {

@@ -53,9 +53,8 @@ Value command(uint64_t n) {
 }
 
 // Commands that pass the entitlement check reach their handler; refused ones
-// get 55. Sent without keys, a handler that validates the user answers 38,
-// staging nothing succeeds, and one not built into this daemon yet answers
-// 49. Of the group and code-signing commands, the caller's own system
+// get 55. Sent without keys, a handler that validates the user answers 38
+// and staging nothing succeeds. Of the group and code-signing commands, the caller's own system
 // container and a missing system group are not its (55), it has no system
 // groups (1, none), processing needs an identifier (18), getting finds
 // nothing (21) and invalidating succeeds. A caller that may look up others
@@ -63,7 +62,10 @@ Value command(uint64_t n) {
 // (26 to 29) need an identifier (11).
 uint64_t reachedHandler(uint64_t command, bool mayLookUpOthers = false) {
     if (command >= 26 && command <= 29) return BTHErrorInvalidArgument;
-    if (command == 3 || command == 16 || command == 20) return BTHErrorSuccess;
+    // 24 migrates nothing on an empty root; 25 does nothing on a build that
+    // is not internal.
+    if (command == 3 || command == 16 || command == 20 || command == 24 || command == 25)
+        return BTHErrorSuccess;
     if (command == 15) return mayLookUpOthers ? BTHErrorSuccess : BTHErrorNotEntitled;
     if (command == 17) return BTHErrorNotEntitled;
     if (command == 18) return BTHErrorIdentifierMissing;
