@@ -18,6 +18,7 @@
 #include "ExitStatus.h"
 #include "GroupCommands.h"
 #include "LockCommand.h"
+#include "MaintenanceCommands.h"
 #include "SendCommand.h"
 #include "SharedContentCommands.h"
 #include "SignCommand.h"
@@ -42,6 +43,7 @@ struct Arguments {
     GroupOptions group;
     CodeSigningCommandOptions codeSigning;
     SharedContentOptions content;
+    MaintenanceOptions maintenance;
 };
 
 std::chrono::milliseconds timeoutOf(double seconds) {
@@ -261,6 +263,26 @@ std::vector<CLI::App*> addSharedContentCommands(CLI::App& app, Arguments& args) 
     return {stage, net, path, remove};
 }
 
+// Adds "migrate" and "retry-test"; returns both.
+std::vector<CLI::App*> addMaintenanceCommands(CLI::App& app, Arguments& args) {
+    MaintenanceOptions& options = args.maintenance;
+    CLI::App* migrate = app.add_subcommand(
+        "migrate",
+        "Run the data migration: system-container access lists, bundle ownership, "
+        "older code-signing records");
+    migrate->callback([&options] { options.action = MaintenanceAction::Migrate; });
+    addConnectionOptions(migrate, args);
+    CLI::App* retry =
+        app.add_subcommand("retry-test",
+                           "Have the daemon exit N times in a row, reconnecting until it succeeds "
+                           "(internal builds)");
+    retry->callback([&options] { options.action = MaintenanceAction::RetryTest; });
+    retry->add_option("--crashes", options.crashes, "How many times the daemon exits (default 2)");
+    retry->add_option("--user", options.user, "User id; 1 (default) is your own user");
+    addConnectionOptions(retry, args);
+    return {migrate, retry};
+}
+
 // Adds "codesign" with its three subcommands.
 CLI::App* addCodeSigningCommands(CLI::App& app, Arguments& args) {
     CLI::App* codesign = app.add_subcommand("codesign", "Record or read code-signing information");
@@ -425,6 +447,7 @@ int main(int argc, char** argv) {
             addGroupCommand(app, action.name, action.description, action.action, args));
     CLI::App* codesign = addCodeSigningCommands(app, args);
     const std::vector<CLI::App*> contentCommands = addSharedContentCommands(app, args);
+    const std::vector<CLI::App*> maintenanceCommands = addMaintenanceCommands(app, args);
 
     // Asked by the shells' completion scripts; never shown in the help.
     if (argc >= 2 && std::string_view(argv[1]) == "__complete")
@@ -470,6 +493,16 @@ int main(int argc, char** argv) {
         args.content.socket = args.send.socket;
         args.content.timeout = timeoutOf(args.timeoutSeconds);
         return runSharedContentCommand(args.content, std::cout, std::cerr);
+    }
+    for (CLI::App* command : maintenanceCommands) {
+        if (!command->parsed()) continue;
+        args.maintenance.json = args.json;
+        args.maintenance.socket = args.send.socket;
+        // The migration may walk every container: a longer wait than a
+        // request's, unless one was asked for.
+        if (command->count("--timeout") > 0)
+            args.maintenance.timeout = timeoutOf(args.timeoutSeconds);
+        return runMaintenanceCommand(args.maintenance, std::cout, std::cerr);
     }
     if (codesign->parsed()) {
         args.codeSigning.json = args.json;
