@@ -1,5 +1,7 @@
 #include "BTHCommandTable.h"
 
+#include <iterator>
+
 #include "BTHCodeSigningCommands.h"
 #include "BTHContainerCommands.h"
 #include "BTHError.h"
@@ -13,15 +15,8 @@ namespace berth {
 
 namespace {
 
-// The handler of commands whose operation has not been built into this
-// daemon yet: the caller learns the command is not available.
-void commandNotAvailable(const BTHRequestRef&, const std::shared_ptr<BTHClientConnection>&,
-                         uint64_t* replyError) {
-    BTHSetErrorCode(replyError, BTHErrorInvalidCommand);
-}
-
-// The handlers built into the daemon, by command number: the one place a new
-// command is plugged in.
+// The handlers of the daemon, by command number: the one place a command is
+// plugged in. Every command has one, in order (checked below).
 constexpr struct {
     uint64_t command;
     BTHCommandHandler handler;
@@ -58,10 +53,16 @@ constexpr struct {
     {29, deleteUserManagedAsset},
 };
 
+constexpr bool everyCommandInOrder() {
+    if (std::size(kHandlers) != kBTHCommandCount) return false;
+    for (uint64_t i = 0; i < std::size(kHandlers); ++i)
+        if (kHandlers[i].command != i || !kHandlers[i].handler) return false;
+    return true;
+}
+static_assert(everyCommandInOrder(), "every command needs its handler, in command order");
+
 BTHCommandHandler handlerOf(uint64_t command) {
-    for (const auto& entry : kHandlers)
-        if (entry.command == command) return entry.handler;
-    return commandNotAvailable;
+    return kHandlers[command].handler;
 }
 
 }  // namespace

@@ -1,7 +1,6 @@
 // The daemon's command table: the shared command rows (number, name,
 // required entitlement, when the reply goes) each paired with its handler,
-// indexed by command number. A command whose operation is not built into the
-// daemon answers BTHErrorInvalidCommand (49) after its entitlement check.
+// indexed by command number.
 #pragma once
 
 #include <array>
