@@ -10,6 +10,9 @@
 // rename (shared with concurrent creations, BTHDirectorySync) before it
 // returns. A look-up that finds a container waits the same way, since what
 // it found may be a concurrent creation whose sync is still running.
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <array>
 #include <cerrno>
 #include <cstring>
@@ -26,6 +29,7 @@
 #include "BTHWhitelist.h"
 #include "core/BTHContainerClass.h"
 #include "platform/DeviceProperties.h"
+#include "platform/SafeFs.h"
 #include "platform/SandboxMappingStore.h"
 
 namespace berth {
@@ -244,7 +248,7 @@ class CreateOrLookup {
         }
         record_ = std::make_shared<BTHMetadata>(userId_, Uuid::random(), containerClass_,
                                                 identifier_, std::nullopt, staging, std::nullopt);
-        if (!record_->writeMetadataToDisk(error)) return false;
+        if (!record_->writeStagedMetadataToDisk(error)) return false;
         if (BTHContainerClassIsSystem(containerClass_) &&
             !BTHFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error))
             return false;
@@ -305,24 +309,33 @@ class CreateOrLookup {
     }
 
   private:
-    // The staged tree's entries (subdirectories, access control list,
-    // ownership) reach the disk; the metadata file already did.
+    // The staged tree reaches the disk: the metadata file's contents, the
+    // entries of "Library" and of the container directory (metadata file,
+    // subdirectories) and the directory's access control list and owner. The
+    // metadata file is written without a sync of its own: on a journalling
+    // file system the first sync here commits the whole tree at once.
     bool syncStaged(const std::filesystem::path& staging, BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
         const std::filesystem::path library = staging / "Library";
         std::error_code ignored;
-        int err = 0;
-        if (std::filesystem::is_directory(library, ignored))
+        int err = syncFile(BTHMetadata::metadataFileURL(staging));
+        if (err == 0 && std::filesystem::is_directory(library, ignored))
             err = BTHDirectorySync::syncDirectory(library);
         if (err == 0) err = BTHDirectorySync::syncDirectory(staging);
-        if (err == 0 && !BTHFaultActive("create.sync-staged")) return true;
-        if (err == 0) err = EIO;
+        if (err == 0 && BTHFaultActive("create.sync-staged")) err = EIO;
+        if (err == 0) return true;
         BTHSetError(
             error,
             BTHMakeError(BTHErrorWriteFailed,
                          BTHMakePOSIXError(err, "fsync of %s failed: %s", staging, strerror(err)),
                          "Failed to sync directory %@ holding %@", staging, staging));
         return false;
+    }
+
+    static int syncFile(const std::filesystem::path& path) {
+        UniqueFd fd = fs::openNoFollow(path, O_RDONLY);
+        if (!fd) return errno;
+        return ::fsync(fd.get()) == 0 ? 0 : errno;
     }
 
     // Step 14: well-known system containers live under their fixed name.
