@@ -14,14 +14,14 @@
 //     (what the file system's own shutdown request does for crash testing),
 //     then kills the daemon. Only what an fsync committed before the cut is
 //     there after remounting, so a container whose class directory was not
-//     synced after its rename (or whose tree was not synced before it) is
-//     lost. Checked by hand: with the class directory's sync removed from
-//     creation, this test fails. It needs loop devices and ext4; without
-//     them it is skipped. What it cannot prove: a disk that lies about its
-//     cache flush, and orderings the kernel's ext4 commits happen to hide (a
-//     later fsync of another file commits the whole journal transaction, so
-//     an unsynced container made just before it survives by luck; the last
-//     replies before each cut have no later fsync to lean on).
+//     synced after its rename is lost. Checked by hand: with the wait for the class directory's
+//     sync removed from creation, this test failed in 3 runs of 3 ("... is gone"). It needs loop
+//     devices and ext4; without them it is skipped. What it cannot prove: a disk that lies about
+//     its cache flush, and orderings that ext4's journal hides. One journal commit carries every
+//     change made before it, so a missing sync of the staged tree is covered
+//     by the class directory's sync after the rename, and an unsynced
+//     container made just before another request's fsync survives by luck;
+//     only the last replies before each cut have no later fsync to lean on.
 #include <fcntl.h>
 #include <linux/ioctl.h>
 #include <sched.h>
@@ -180,6 +180,9 @@ class DaemonDurableCreate : public DaemonFixture {
             std::optional<Value> metadata = BTH_dictionaryWithContentsOfURL(
                 fs::path(container.path) / kBTHMetadataFileName, 0, nullptr);
             ASSERT_TRUE(metadata) << container.path;
+            for (const char* subdirectory : {"Documents", "Library/Caches", "tmp"})
+                EXPECT_TRUE(fs::is_directory(fs::path(container.path) / subdirectory))
+                    << container.path << " lost " << subdirectory;
             EXPECT_EQ(text(*metadata, "BTHMetadataIdentifier"), container.identifier);
             const Value* uuid = metadata->find("BTHMetadataUUID");
             ASSERT_TRUE(uuid && uuid->string() && container.uuid.uuid());
