@@ -14,9 +14,14 @@
 // rebuild is timed over several daemon starts (each start builds the map
 // anew; the files are in the page cache after the first).
 //
-//   container_bench <path of berthd> [seconds per throughput row, default 3]
+//   container_bench <path of berthd> [--against=<path of another berthd>]
+//                   [seconds per throughput row, default 3]
 //                   [containers in the rebuilt class, default 10000]
 //                   [daemon starts for the rebuild, default 5]
+//
+// With --against, the create rows are measured for both daemons in one run,
+// on the same device root, one daemon at a time in the order A B B A per
+// client count: side by side with another build (say, of main).
 //
 // Run as root (the daemon must be able to own what it makes); the defaults
 // take about half a minute. The scratch device root is removed afterwards,
@@ -48,6 +53,7 @@
 #include "BTHMetadata.h"
 #include "BenchDaemon.h"
 #include "BenchLatency.h"
+#include "BenchSummary.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/UniqueFd.h"
@@ -182,11 +188,45 @@ bench::Latency measure(const std::filesystem::path& socket, int clients, double 
     });
 }
 
+// Creates under fresh identifiers ("<row>.<clients>.<client>.<n>") through
+// a daemon of `binary` started for this row alone.
+bench::Latency measureCreates(const std::filesystem::path& binary,
+                              const std::filesystem::path& root, int clients, double seconds,
+                              size_t row) {
+    BenchDaemon daemon(binary, root);
+    const std::string prefix =
+        "sys.kelp.bench.new." + std::to_string(row) + "." + std::to_string(clients) + ".";
+    return measure(daemon.socket(), clients, seconds, [&prefix](int client, uint64_t n) {
+        return lookupRequest(kDataApplication,
+                             prefix + std::to_string(client) + "." + std::to_string(n), true);
+    });
+}
+
+// The mean of the rows of one build.
+bench::Latency mean(const std::vector<std::pair<bool, bench::Latency>>& rows, bool mine) {
+    bench::Latency sum;
+    int count = 0;
+    for (const auto& [isMine, latency] : rows) {
+        if (isMine != mine) continue;
+        sum.requestsPerSecond += latency.requestsPerSecond;
+        sum.p50Microseconds += latency.p50Microseconds;
+        sum.p99Microseconds += latency.p99Microseconds;
+        sum.failures += latency.failures;
+        ++count;
+    }
+    if (count == 0) return sum;
+    sum.requestsPerSecond /= count;
+    sum.p50Microseconds /= count;
+    sum.p99Microseconds /= count;
+    return sum;
+}
+
 struct Settings {
     std::filesystem::path berthd;
-    double seconds = 3;      // per throughput row
-    uint64_t count = 10000;  // containers in the rebuilt class
-    int starts = 5;          // daemon starts timing the rebuild
+    std::optional<std::filesystem::path> against;  // another build, for the create rows
+    double seconds = 3;                            // per throughput row
+    uint64_t count = 10000;                        // containers in the rebuilt class
+    int starts = 5;                                // daemon starts timing the rebuild
 };
 
 void run(const Settings& settings, const std::filesystem::path& root) {
@@ -210,28 +250,45 @@ void run(const Settings& settings, const std::filesystem::path& root) {
                 rebuilds.front().firstMilliseconds, median.nextMilliseconds,
                 median.firstMilliseconds / median.nextMilliseconds);
 
-    BenchDaemon daemon(settings.berthd, root);
+    bench::printSummary("container", "first look-up of " + std::to_string(settings.count), "ms",
+                        median.firstMilliseconds, "next look-up", median.nextMilliseconds);
+
     bench::printLatencyHeader();
     for (int clients : {1, 8}) {
-        // Fresh identifiers in every row: "<clients>.<client>.<n>".
-        bench::printLatencyRow(
-            "create", clients,
-            measure(daemon.socket(), clients, settings.seconds, [clients](int client, uint64_t n) {
-                return lookupRequest(kDataApplication,
-                                     "sys.kelp.bench.new." + std::to_string(clients) + "." +
-                                         std::to_string(client) + "." + std::to_string(n),
-                                     true);
-            }));
+        // This build, the other, the other, this: drift favours neither.
+        std::vector<std::pair<bool, bench::Latency>> rows;
+        for (bool mine : {true, false, false, true}) {
+            if (!mine && !settings.against) continue;
+            rows.emplace_back(mine, measureCreates(mine ? settings.berthd : *settings.against, root,
+                                                   clients, settings.seconds, rows.size()));
+            bench::printLatencyRow(mine ? "create" : "create (against)", clients,
+                                   rows.back().second);
+        }
+        const bench::Latency mine = mean(rows, true);
+        const std::string workload = "create, " + std::to_string(clients) + " clients";
+        if (!settings.against) {
+            bench::printSummary("container", workload, "req/s", mine.requestsPerSecond, "", 0);
+            continue;
+        }
+        const bench::Latency other = mean(rows, false);
+        bench::printSummary("container", workload, "req/s", mine.requestsPerSecond,
+                            "--against build", other.requestsPerSecond);
+        bench::printSummary("container", workload + " p99", "us", mine.p99Microseconds,
+                            "--against build", other.p99Microseconds);
     }
+
+    BenchDaemon daemon(settings.berthd, root);
     const uint64_t count = settings.count;
     for (int clients : {1, 8}) {
-        bench::printLatencyRow(
-            "lookup", clients,
+        const bench::Latency lookup =
             measure(daemon.socket(), clients, settings.seconds, [count](int client, uint64_t n) {
                 // Each client walks the containers from its own start.
                 return lookupRequest(kDataApplication,
                                      rebuiltIdentifier((n + client * 7919) % count), false);
-            }));
+            });
+        bench::printLatencyRow("lookup", clients, lookup);
+        bench::printSummary("container", "look-up, " + std::to_string(clients) + " clients",
+                            "req/s", lookup.requestsPerSecond, "", 0);
     }
 }
 
@@ -243,16 +300,25 @@ int main(int argc, char** argv) {
     std::setvbuf(stdout, nullptr, _IOLBF, 0);  // rows appear as they are measured
     if (argc < 2) {
         std::fprintf(stderr,
-                     "usage: container_bench <path of berthd> [seconds per row, default 3] "
+                     "usage: container_bench <path of berthd> [--against=<another berthd>] "
+                     "[seconds per row, default 3] "
                      "[containers in the rebuilt class, default 10000] [daemon starts for the "
                      "rebuild, default 5]\n");
         return 64;
     }
     Settings settings;
     settings.berthd = std::filesystem::absolute(argv[1]);
-    if (argc > 2) settings.seconds = std::atof(argv[2]);
-    if (argc > 3) settings.count = std::strtoull(argv[3], nullptr, 10);
-    if (argc > 4) settings.starts = std::atoi(argv[4]);
+    std::vector<const char*> rest;
+    for (int i = 2; i < argc; ++i) {
+        const std::string argument = argv[i];
+        if (argument.rfind("--against=", 0) == 0)
+            settings.against = std::filesystem::absolute(argument.substr(10));
+        else
+            rest.push_back(argv[i]);
+    }
+    if (rest.size() > 0) settings.seconds = std::atof(rest[0]);
+    if (rest.size() > 1) settings.count = std::strtoull(rest[1], nullptr, 10);
+    if (rest.size() > 2) settings.starts = std::atoi(rest[2]);
     if (settings.seconds <= 0 || settings.count == 0 || settings.starts < 1) {
         std::fprintf(stderr, "container_bench: seconds, containers and starts must be positive\n");
         return 64;

@@ -37,6 +37,7 @@
 #include <vector>
 
 #include "BenchDaemon.h"
+#include "BenchSummary.h"
 #include "core/RelayCodec.h"
 #include "platform/UniqueFd.h"
 
@@ -231,7 +232,13 @@ int main(int argc, char** argv) {
         for (const Cost& cost : costs) wall.push_back(cost.wall), cpu.push_back(cost.cpu);
         return Cost{median(wall), median(cpu)};
     };
-    printRow("med", "", medianOf(daemonCosts), medianOf(rmCosts));
+    const Cost daemonMedian = medianOf(daemonCosts), rmMedian = medianOf(rmCosts);
+    printRow("med", "", daemonMedian, rmMedian);
+    const std::string tree = std::to_string(files) + " files";
+    bench::printSummary("deathrow", "empty " + tree + ", wall", "s", daemonMedian.wall, "rm -rf",
+                        rmMedian.wall);
+    bench::printSummary("deathrow", "empty " + tree + ", cpu", "s", daemonMedian.cpu, "rm -rf",
+                        rmMedian.cpu);
     std::error_code ignored;
     fs::remove_all(dir, ignored);
     return 0;

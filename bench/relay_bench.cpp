@@ -38,6 +38,7 @@
 #include <vector>
 
 #include "BenchDaemon.h"
+#include "BenchSummary.h"
 #include "core/RelayCodec.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/NamedSemaphore.h"
@@ -278,6 +279,12 @@ int main(int argc, char** argv) {
                         baseline.requestsPerSecond > 0
                             ? result.requestsPerSecond / baseline.requestsPerSecond
                             : 0.0);
+        for (const auto& [name, result] : rows) {
+            if (std::string(name) == "echo") continue;
+            bench::printSummary(
+                "relay", std::string(name) + ", " + std::to_string(clients) + " clients", "req/s",
+                result.requestsPerSecond, "echo server", baseline.requestsPerSecond);
+        }
     }
     daemon.reset();
     relay.reset();

@@ -27,6 +27,7 @@
 #include "BTHCodeSigningMapping.h"
 #include "BenchDaemon.h"
 #include "BenchLatency.h"
+#include "BenchSummary.h"
 #include "packbuff/packbuff.h"
 #include "platform/UpcallTransport.h"
 
@@ -119,14 +120,15 @@ void run(const std::filesystem::path& berthd, const std::filesystem::path& root,
 
     bench::printLatencyHeader();
     for (int clients : {1, 8}) {
-        bench::printLatencyRow("upcall", clients,
-                               bench::measureRoundTrips(clients, seconds, [&](int) {
-                                   return upcallClient(upcallSocket, request);
-                               }));
-        bench::printLatencyRow("lookup", clients,
-                               bench::measureRoundTrips(clients, seconds, [&](int) {
-                                   return lookupClient(daemon.socket());
-                               }));
+        const bench::Latency upcall = bench::measureRoundTrips(
+            clients, seconds, [&](int) { return upcallClient(upcallSocket, request); });
+        bench::printLatencyRow("upcall", clients, upcall);
+        const bench::Latency lookup = bench::measureRoundTrips(
+            clients, seconds, [&](int) { return lookupClient(daemon.socket()); });
+        bench::printLatencyRow("lookup", clients, lookup);
+        bench::printSummary("upcall", "process containers, " + std::to_string(clients) + " clients",
+                            "req/s", upcall.requestsPerSecond, "socket look-up",
+                            lookup.requestsPerSecond);
     }
 }
 

@@ -29,6 +29,7 @@
 #include <vector>
 
 #include "BenchDaemon.h"
+#include "BenchSummary.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -186,6 +187,8 @@ void run(const Settings& settings, const std::filesystem::path& root) {
                 *std::min_element(duTimes.begin(), duTimes.end()), (unsigned long long)duBytes);
     std::printf("ratio berthd/du (medians): %.2fx over %d alternating rounds\n",
                 median(daemonTimes) / median(duTimes), settings.rounds);
+    bench::printSummary("usage", "command 23, " + std::to_string(settings.files) + " files", "ms",
+                        median(daemonTimes), "du -s", median(duTimes));
 }
 
 }  // namespace

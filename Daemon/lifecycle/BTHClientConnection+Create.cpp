@@ -4,11 +4,23 @@
 // only then moved into its live place with one rename, so look-ups never see
 // a half-built container and a crash leaves at most a staging leftover that
 // the next start sends to death row.
+//
+// An answer is durable: the staged tree is synced before the rename, and the
+// caller waits for a sync of the class directory that started after the
+// rename (shared with concurrent creations, BTHDirectorySync) before it
+// returns. A look-up that finds a container waits the same way, since what
+// it found may be a concurrent creation whose sync is still running.
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <array>
+#include <cerrno>
+#include <cstring>
 
 #include "BTHClientConnection.h"
 #include "BTHCodeSigningMapping.h"
 #include "BTHContainerCache.h"
+#include "BTHDirectorySync.h"
 #include "BTHFaultInjection.h"
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
@@ -17,6 +29,7 @@
 #include "BTHWhitelist.h"
 #include "core/BTHContainerClass.h"
 #include "platform/DeviceProperties.h"
+#include "platform/SafeFs.h"
 #include "platform/SandboxMappingStore.h"
 
 namespace berth {
@@ -153,8 +166,9 @@ bool BTHClientConnection::_setSandboxContainerMappingForUser(
 
 namespace {
 
-// The steps of one create-or-look-up call that run under the lock, with the
-// staging directory they may leave behind.
+// The steps of one create-or-look-up call, with the staging directory they
+// may leave behind. The caller runs lookUp() and commit() under the
+// all-identifiers lock; stage() and waitUntilDurable() need no lock.
 class CreateOrLookup {
   public:
     CreateOrLookup(BTHClientConnection& client, uid_t userId, const std::string& identifier,
@@ -163,22 +177,123 @@ class CreateOrLookup {
           userId_(userId),
           identifier_(identifier),
           containerClass_(containerClass),
-          transient_(transient) {}
+          transient_(transient),
+          classDirectory_(BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+              userId, containerClass, transient)) {}
 
-    // Steps 6 to 18; on failure `error` holds why.
-    BTHMetadataRef run(bool createIfNecessary, BTHErrorRef* error) {
+    enum class Found { kNone, kContainer, kFailure };
+
+    // Step 6. kContainer: the permanent container in `*result`; kFailure:
+    // the look-up failed with anything but "not found" (or a transient
+    // container could not be retired); kNone: there is none (any transient
+    // one is retired).
+    Found lookUp(BTHMetadataRef* result, BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
-        bool found = false;
-        BTHMetadataRef existing = lookUp(&found, error);
-        if (existing) return existing;
-        if (found) return nullptr;  // a failure other than "not found"
-        if (!createIfNecessary) {
-            BTHSetError(error, BTHMakeUnloggedError(BTHErrorNotFound, nullptr,
-                                                    "Container with identifier: \"%@\" Not Found",
-                                                    identifier_));
+        BTHContainerCache& cache = BTHContainerCache::sharedInstance();
+        BTHErrorRef cacheError;
+        BTHMetadataRef found =
+            cache.containerForUser(userId_, containerClass_, identifier_, transient_, &cacheError);
+        if (!found) {
+            if (cacheError && cacheError->isBTHError(BTHErrorNotFound)) return Found::kNone;
+            BTHSetError(error, cacheError);
+            return Found::kFailure;
+        }
+        if (!transient_) {
+            // The caller gets a snapshot: the cached record may change once
+            // the lock is released.
+            *result = std::make_shared<BTHMetadata>(*found);
+            (*result)->setExisted(true);
+            // The container may be another call's creation whose rename is
+            // not durable yet: the caller waits for it before answering.
+            if (classDirectory_)
+                change_ = BTHDirectorySync::sharedInstance().lastChange(*classDirectory_);
+            return Found::kContainer;
+        }
+        BTHErrorRef deathRowError;
+        if (!client_._moveItemAtURLToDeathRow(found->url(), true, true, &deathRowError)) {
+            BTHSetError(error,
+                        BTHMakeError(BTHErrorRemoveTransientFailed, deathRowError,
+                                     "Failed to remove transient container at %@", found->url()));
+            return Found::kFailure;
+        }
+        // The retired container leaves the cache too: a look-up that does
+        // not create must not leave behind an entry whose directory is gone.
+        cache.removeContainerForUser(userId_, containerClass_, identifier_, true, nullptr);
+        return Found::kNone;
+    }
+
+    // Step 7: the error of a look-up that may not create.
+    BTHErrorRef notFound() const {
+        BTH_FUNCTION(kCreateFunction);
+        return BTHMakeUnloggedError(BTHErrorNotFound, nullptr,
+                                    "Container with identifier: \"%@\" Not Found", identifier_);
+    }
+
+    // Steps 8 to 12: the whole container in a staging directory of its own,
+    // durable there, so the rename into place is the last change it needs.
+    bool stage(BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        directoryName_ = Uuid::random().string();
+        const std::filesystem::path staging =
+            BTHGlobalConfiguration::sharedInstance().stagingDirectory() / directoryName_;
+        stagingURL_ = staging;
+
+        BTHErrorRef stepError;
+        if (!client_._createTopLevelContainerDirectory(staging, containerClass_, userId_,
+                                                       &stepError)) {
+            BTHSetError(
+                error, BTHMakeError(BTHErrorCreateStagingFailed, stepError,
+                                    "Failed to create staging dir at %@ : %@", staging, stepError));
+            return false;
+        }
+        record_ = std::make_shared<BTHMetadata>(userId_, Uuid::random(), containerClass_,
+                                                identifier_, std::nullopt, staging, std::nullopt);
+        if (!record_->writeStagedMetadataToDisk(error)) return false;
+        if (BTHContainerClassIsSystem(containerClass_) &&
+            !BTHFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error))
+            return false;
+        if (!client_._createSubDirectories(staging, userId_, containerClass_, error)) return false;
+        if (!syncStaged(staging, error)) return false;
+        BTHCrashPoint("create.staged");
+        return true;
+    }
+
+    // Steps 13 to 18: the staged container moves into place and into the
+    // cache. Its rename is noted for waitUntilDurable().
+    BTHMetadataRef commit(BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        const std::filesystem::path staging = *stagingURL_;
+        const std::filesystem::path live =
+            (classDirectory_ ? *classDirectory_ : std::filesystem::path()) / liveName();
+        BTHErrorRef stepError;
+        if (!classDirectory_ ||
+            !BTHFileManager::defaultManager().moveItemAtURL(staging, live, &stepError)) {
+            BTHSetError(error, BTHMakeError(BTHErrorMoveStagingFailed, stepError,
+                                            "Failed to move staging dir: %@ to live dir: %@",
+                                            staging, live));
             return nullptr;
         }
-        return create(error);
+        change_ = BTHDirectorySync::sharedInstance().noteChange(*classDirectory_);
+        stagingURL_.reset();
+        record_->setUrl(live);
+        record_->setExisted(false);
+        record_->setTransient(transient_);
+        return addToCache(live, error);
+    }
+
+    // What the reply promises: the container's entry in its class directory
+    // (the one the caller found, or the one commit() made) survives a crash.
+    bool waitUntilDurable(const BTHMetadataRef& result, BTHErrorRef* error) {
+        BTH_FUNCTION(kCreateFunction);
+        if (!classDirectory_ || change_ == 0) return true;
+        BTHErrorRef syncError;
+        if (BTHDirectorySync::sharedInstance().waitUntilDurable(*classDirectory_, change_,
+                                                                &syncError))
+            return true;
+        BTHSetError(error, BTHMakeError(BTHErrorWriteFailed, syncError,
+                                        "Failed to sync directory %@ holding %@", *classDirectory_,
+                                        result->url()));
+        return false;
     }
 
     // Step 19.1: a staging directory still pending goes to death row.
@@ -194,101 +309,48 @@ class CreateOrLookup {
     }
 
   private:
-    // Step 6. Returns the found permanent container; sets `*failed` when the
-    // look-up failed with anything but "not found" (or a transient container
-    // could not be retired).
-    BTHMetadataRef lookUp(bool* failed, BTHErrorRef* error) {
+    // The staged tree reaches the disk: the metadata file's contents, the
+    // entries of "Library" and of the container directory (metadata file,
+    // subdirectories) and the directory's access control list and owner. The
+    // metadata file is written without a sync of its own: on a journalling
+    // file system the first sync here commits the whole tree at once.
+    bool syncStaged(const std::filesystem::path& staging, BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
-        BTHContainerCache& cache = BTHContainerCache::sharedInstance();
-        BTHErrorRef cacheError;
-        BTHMetadataRef found =
-            cache.containerForUser(userId_, containerClass_, identifier_, transient_, &cacheError);
-        if (!found) {
-            if (cacheError && cacheError->isBTHError(BTHErrorNotFound)) return nullptr;
-            *failed = true;
-            BTHSetError(error, cacheError);
-            return nullptr;
-        }
-        if (!transient_) {
-            // The caller gets a snapshot: the cached record may change once
-            // the lock is released.
-            auto snapshot = std::make_shared<BTHMetadata>(*found);
-            snapshot->setExisted(true);
-            return snapshot;
-        }
-        BTHErrorRef deathRowError;
-        if (!client_._moveItemAtURLToDeathRow(found->url(), true, true, &deathRowError)) {
-            *failed = true;
-            BTHSetError(error,
-                        BTHMakeError(BTHErrorRemoveTransientFailed, deathRowError,
-                                     "Failed to remove transient container at %@", found->url()));
-            return nullptr;
-        }
-        // The retired container leaves the cache too: a look-up that does
-        // not create must not leave behind an entry whose directory is gone.
-        cache.removeContainerForUser(userId_, containerClass_, identifier_, true, nullptr);
-        return nullptr;
+        const std::filesystem::path library = staging / "Library";
+        std::error_code ignored;
+        int err = syncFile(BTHMetadata::metadataFileURL(staging));
+        if (err == 0 && std::filesystem::is_directory(library, ignored))
+            err = BTHDirectorySync::syncDirectory(library);
+        if (err == 0) err = BTHDirectorySync::syncDirectory(staging);
+        if (err == 0 && BTHFaultActive("create.sync-staged")) err = EIO;
+        if (err == 0) return true;
+        BTHSetError(
+            error,
+            BTHMakeError(BTHErrorWriteFailed,
+                         BTHMakePOSIXError(err, "fsync of %s failed: %s", staging, strerror(err)),
+                         "Failed to sync directory %@ holding %@", staging, staging));
+        return false;
     }
 
-    // Steps 8 to 18.
-    BTHMetadataRef create(BTHErrorRef* error) {
-        BTH_FUNCTION(kCreateFunction);
-        const Uuid directoryUuid = Uuid::random();
-        const std::string directoryName = directoryUuid.string();
-        BTHGlobalConfiguration& configuration = BTHGlobalConfiguration::sharedInstance();
-        const std::filesystem::path staging = configuration.stagingDirectory() / directoryName;
-        stagingURL_ = staging;
-
-        BTHErrorRef stepError;
-        if (!client_._createTopLevelContainerDirectory(staging, containerClass_, userId_,
-                                                       &stepError)) {
-            BTHSetError(
-                error, BTHMakeError(BTHErrorCreateStagingFailed, stepError,
-                                    "Failed to create staging dir at %@ : %@", staging, stepError));
-            return nullptr;
-        }
-        auto record =
-            std::make_shared<BTHMetadata>(userId_, Uuid::random(), containerClass_, identifier_,
-                                          std::nullopt, staging, std::nullopt);
-        if (!record->writeMetadataToDisk(error)) return nullptr;
-        if (BTHContainerClassIsSystem(containerClass_) &&
-            !BTHFileManager::defaultManager().setTopLevelSystemContainerACLAtURL(staging, error))
-            return nullptr;
-        if (!client_._createSubDirectories(staging, userId_, containerClass_, error))
-            return nullptr;
-        BTHCrashPoint("create.staged");
-
-        const std::optional<std::filesystem::path> parent =
-            configuration.containerDirectoryURLForUser(userId_, containerClass_, transient_);
-        const std::filesystem::path live =
-            (parent ? *parent : std::filesystem::path()) / liveName(directoryName);
-        if (!parent || !BTHFileManager::defaultManager().moveItemAtURL(staging, live, &stepError)) {
-            BTHSetError(error, BTHMakeError(BTHErrorMoveStagingFailed, stepError,
-                                            "Failed to move staging dir: %@ to live dir: %@",
-                                            staging, live));
-            return nullptr;
-        }
-        stagingURL_.reset();
-        record->setUrl(live);
-        record->setExisted(false);
-        record->setTransient(transient_);
-        return addToCache(record, live, error);
+    static int syncFile(const std::filesystem::path& path) {
+        UniqueFd fd = fs::openNoFollow(path, O_RDONLY);
+        if (!fd) return errno;
+        return ::fsync(fd.get()) == 0 ? 0 : errno;
     }
 
     // Step 14: well-known system containers live under their fixed name.
-    std::string liveName(const std::string& directoryName) const {
+    std::string liveName() const {
         const BTHWhitelist& whitelist = BTHWhitelist::sharedWhitelist();
         std::optional<std::string> wellKnown;
         if (containerClass_ == BTHContainerClassDataSystem)
             wellKnown = whitelist.wellknownSystemContainerForId(identifier_);
         else if (containerClass_ == BTHContainerClassSharedSystemGroup)
             wellKnown = whitelist.wellknownSystemGroupContainerForId(identifier_);
-        return wellKnown ? *wellKnown : directoryName;
+        return wellKnown ? *wellKnown : directoryName_;
     }
 
     // Step 17. The live directory stays even when the cache refuses it.
-    BTHMetadataRef addToCache(const BTHMetadataRef& record, const std::filesystem::path& live,
-                              BTHErrorRef* error) {
+    BTHMetadataRef addToCache(const std::filesystem::path& live, BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
         BTHErrorRef cacheError;
         bool added = false;
@@ -297,16 +359,16 @@ class CreateOrLookup {
                                               "Invalid input: URL: %@", live);
         } else {
             added = BTHContainerCache::sharedInstance().addContainerMetadata(
-                record, userId_, live, transient_, &cacheError);
+                record_, userId_, live, transient_, &cacheError);
         }
         if (!added) {
             BTHSetError(error,
                         BTHMakeError(BTHErrorCacheAddFailed, cacheError,
                                      "Failed to add to cache for %u : %@, url: %@, transient: %d",
-                                     userId_, record, live, transient_));
+                                     userId_, record_, live, transient_));
             return nullptr;
         }
-        return std::make_shared<BTHMetadata>(*record);
+        return std::make_shared<BTHMetadata>(*record_);
     }
 
     BTHClientConnection& client_;
@@ -314,8 +376,46 @@ class CreateOrLookup {
     const std::string identifier_;
     const uint64_t containerClass_;
     const bool transient_;
+    const std::optional<std::filesystem::path> classDirectory_;
+    std::string directoryName_;
     std::optional<std::filesystem::path> stagingURL_;
+    BTHMetadataRef record_;
+    uint64_t change_ = 0;  // the class directory's change the reply waits for
 };
+
+// Runs one create or look-up. With `useLocking`, the all-identifiers lock is
+// held for the look-up and, when a container must be made, again for the
+// second look-up and the rename; the container is staged between the two,
+// so concurrent creations build and sync their trees in parallel and only
+// check-and-rename one at a time. The second look-up keeps creation of one
+// identifier serialised: a concurrent call that got there first wins and its
+// container is the answer; the loser's staging goes to death row. Without
+// `useLocking` the caller holds the lock throughout.
+BTHMetadataRef createOrLookup(CreateOrLookup& operation, bool createIfNecessary, bool useLocking,
+                              BTHErrorRef* error) {
+    using Found = CreateOrLookup::Found;
+    BTHMetadataRef result;
+    Found found;
+    {
+        BTHAllIdentifiersLockGuard lock(true, useLocking);
+        found = operation.lookUp(&result, error);
+        if (found == Found::kFailure) return nullptr;
+        if (found == Found::kNone && !createIfNecessary) {
+            BTHSetError(error, operation.notFound());
+            return nullptr;
+        }
+        if (found == Found::kNone && !useLocking)
+            result = operation.stage(error) ? operation.commit(error) : nullptr;
+    }
+    if (found == Found::kNone && useLocking) {
+        if (!operation.stage(error)) return nullptr;
+        BTHAllIdentifiersLockGuard lock(true);
+        found = operation.lookUp(&result, error);
+        if (found == Found::kNone) result = operation.commit(error);
+    }
+    if (!result || !operation.waitUntilDurable(result, error)) return nullptr;
+    return result;
+}
 
 }  // namespace
 
@@ -357,20 +457,24 @@ BTHMetadataRef BTHClientConnection::createOrLookupContainerForUser(
     uid_t userId, const std::optional<std::string>& identifier, bool createIfNecessary,
     uint64_t containerClass, bool transient, bool useLocking, uint64_t* error) {
     BTH_FUNCTION(kCreateFunction);
-    std::optional<BTHAllIdentifiersLockGuard> lock;
     std::optional<CreateOrLookup> operation;
     BTHMetadataRef result;
     BTHErrorRef failure = BTHRunUnderExceptionRule(bthFunctionName, __LINE__, [&]() {
         BTHErrorRef error = checkCreateOrLookupRequest(userId, identifier, containerClass);
         if (error) return error;
-        lock.emplace(true, useLocking);
         operation.emplace(*this, userId, *identifier, containerClass, transient);
-        result = operation->run(createIfNecessary, &error);
+        result = createOrLookup(*operation, createIfNecessary, useLocking, &error);
         return error;
     });
     if (failure) result = nullptr;
-    if (operation) operation->cleanUp(&failure);
-    lock.reset();
+    if (operation) {
+        // A staging directory is still pending after a failure, or after a
+        // concurrent creation of the same identifier won; only the former
+        // fails the call.
+        BTHErrorRef cleanUpError;
+        operation->cleanUp(&cleanUpError);
+        if (!result && cleanUpError) failure = cleanUpError;
+    }
     if (failure || !result) {
         BTHSetErrorCode(error, failure ? failure->code64() : uint64_t{BTHErrorNotFound});
         return nullptr;

@@ -98,8 +98,11 @@ class BTHClientConnection {
     // place by one rename (existed false). A transient container is never
     // reused: a found one goes to death row and a new one is made. Nothing is
     // left in staging on any path: leftovers go to death row. With
-    // `useLocking` the whole operation holds the all-identifiers lock for
-    // writing. On failure returns null and stores the code through `error`.
+    // `useLocking` it holds the all-identifiers lock for writing to look up
+    // and to rename into place, not while it builds in staging. What it
+    // returns survives a crash: the container's tree and its entry in the
+    // class directory are on disk. On failure returns null and stores the
+    // code through `error`.
     BTHMetadataRef createOrLookupContainerForUser(uid_t userId,
                                                   const std::optional<std::string>& identifier,
                                                   bool createIfNecessary, uint64_t containerClass,

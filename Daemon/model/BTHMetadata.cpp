@@ -136,6 +136,14 @@ std::filesystem::path BTHMetadata::metadataFileURL(const std::filesystem::path& 
 }
 
 bool BTHMetadata::writeMetadataToDisk(BTHErrorRef* error) const {
+    return write(kBTHStateFileWriteOptions, error);
+}
+
+bool BTHMetadata::writeStagedMetadataToDisk(BTHErrorRef* error) const {
+    return write(kBTHStateFileWriteOptions | BTHWriteSyncLater, error);
+}
+
+bool BTHMetadata::write(uint32_t options, BTHErrorRef* error) const {
     BTH_FUNCTION("-[BTHMetadata writeMetadataToDiskWithError:]");
     Value dict = Value::dictionary();
     if (info_) dict.set(kBTHMetadataInfoKey, *info_);
@@ -149,8 +157,7 @@ bool BTHMetadata::writeMetadataToDisk(BTHErrorRef* error) const {
     BTHErrorRef writeError;
     if (BTHFaultActive("metadata.write")) {
         writeError = BTHMakePOSIXError(EIO, "%s", strerror(EIO));
-    } else if (BTH_writeToURL(dict, metadataFileURL(url_), kBTHStateFileWriteOptions,
-                              &writeError)) {
+    } else if (BTH_writeToURL(dict, metadataFileURL(url_), options, &writeError)) {
         return true;
     }
     BTHSetError(error, BTHMakeError(BTHErrorWriteFailed, writeError,

@@ -108,6 +108,10 @@ class BTHMetadata {
     // (BTHErrorWriteFailed, logged) whose underlying error is the writer's;
     // the old file, if any, is then left as it was and no partial file is.
     bool writeMetadataToDisk(BTHErrorRef* error) const;
+    // The same for a container still being built in staging: atomic, but
+    // not yet durable; the builder syncs the file and the tree before the
+    // container is published.
+    bool writeStagedMetadataToDisk(BTHErrorRef* error) const;
 
     // Reads and validates the metadata file of the container at
     // `containerURL` for `expectedUser`. Returns a new record whose uid is
@@ -131,6 +135,8 @@ class BTHMetadata {
     friend bool operator==(const BTHMetadata&, const BTHMetadata&) = default;
 
   private:
+    bool write(uint32_t options, BTHErrorRef* error) const;
+
     Uuid uuid_;
     uint64_t containerClass_;
     uid_t uid_;

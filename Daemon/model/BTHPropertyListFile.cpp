@@ -29,17 +29,20 @@ bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
     return true;
 }
 
-// Writes `bytes` as `name` inside the open directory `dirFd`, atomically and
-// durably. errno tells why on failure; no temporary file is left behind.
-bool writeAtomically(int dirFd, const std::string& name, const std::vector<uint8_t>& bytes) {
+// Writes `bytes` as `name` inside the open directory `dirFd`, atomically, and
+// durably unless `syncLater`. errno tells why on failure; no temporary file is
+// left behind.
+bool writeAtomically(int dirFd, const std::string& name, const std::vector<uint8_t>& bytes,
+                     bool syncLater) {
     const std::string temp = "." + name + "." + Uuid::random().string() + ".tmp";
     UniqueFd fd(
         ::openat(dirFd, temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
     if (!fd) return false;
-    bool ok = writeAll(fd.get(), bytes) && ::fsync(fd.get()) == 0;
+    bool ok = writeAll(fd.get(), bytes) && (syncLater || ::fsync(fd.get()) == 0);
     int saved = errno;
     fd.reset();
-    if (ok && ::renameat(dirFd, temp.c_str(), dirFd, name.c_str()) == 0) return ::fsync(dirFd) == 0;
+    if (ok && ::renameat(dirFd, temp.c_str(), dirFd, name.c_str()) == 0)
+        return syncLater || ::fsync(dirFd) == 0;
     saved = errno ? errno : saved;
     ::unlinkat(dirFd, temp.c_str(), 0);
     errno = saved;
@@ -67,8 +70,9 @@ bool BTH_writeToURL(const Value& dictionary, const std::filesystem::path& url, u
     }
     UniqueFd dir = fs::openNoFollow(url.parent_path(), O_RDONLY | O_DIRECTORY);
     const std::string name = url.filename().string();
-    bool ok = dir && ((options & BTHWriteAtomic) ? writeAtomically(dir.get(), name, *bytes)
-                                                 : writeInPlace(dir.get(), name, *bytes));
+    bool ok = dir && ((options & BTHWriteAtomic)
+                          ? writeAtomically(dir.get(), name, *bytes, options & BTHWriteSyncLater)
+                          : writeInPlace(dir.get(), name, *bytes));
     if (!ok) {
         int errnum = errno;
         BTHSetError(error, BTHMakePOSIXError(errnum, "Failed to write %s: %s", url.c_str(),

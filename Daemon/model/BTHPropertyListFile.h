@@ -14,8 +14,12 @@ namespace berth {
 
 // Write options: the file is replaced atomically; protection class "none"
 // (the file carries no protection class of its own).
+// BTHWriteSyncLater, with BTHWriteAtomic: atomic, but the caller makes the
+// file and its directory durable itself (a file inside a tree that is synced
+// as a whole before anything can find it).
 enum : uint32_t {
     BTHWriteAtomic = 1u << 0,
+    BTHWriteSyncLater = 1u << 1,
     BTHWriteFileProtectionNone = 1u << 28,
 };
 inline constexpr uint32_t kBTHStateFileWriteOptions = BTHWriteAtomic | BTHWriteFileProtectionNone;

@@ -62,12 +62,12 @@ Latency measureRoundTrips(int clients, double seconds,
 }
 
 void printLatencyHeader() {
-    std::printf("%-8s %7s %12s %10s %10s\n", "workload", "clients", "requests/s", "p50 us",
+    std::printf("%-16s %7s %12s %10s %10s\n", "workload", "clients", "requests/s", "p50 us",
                 "p99 us");
 }
 
 void printLatencyRow(const char* workload, int clients, const Latency& result) {
-    std::printf("%-8s %7d %12.0f %10.1f %10.1f", workload, clients, result.requestsPerSecond,
+    std::printf("%-16s %7d %12.0f %10.1f %10.1f", workload, clients, result.requestsPerSecond,
                 result.p50Microseconds, result.p99Microseconds);
     if (result.failures) std::printf("   (%llu failed)", (unsigned long long)result.failures);
     std::printf("\n");
