@@ -16,7 +16,7 @@ void performDataMigration(const BTHRequestRef&, const std::shared_ptr<BTHClientC
     if (BTHContainerMigrator::sharedInstance().performDataMigratorMigrationWithError(&error))
         return;
     BTHLogError("Failed to perform data migration : %@", error);
-    *replyError = error ? error->code64() : BTHErrorException;
+    *replyError = error ? error->code64() : uint64_t{BTHErrorException};
 }
 
 void retryTest(const BTHRequestRef& request, const std::shared_ptr<BTHClientConnection>& client,

@@ -14,6 +14,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "BTHAsyncWork.h"
 #include "BTHLog.h"
 #include "BTHPropertyListFile.h"
 #include "platform/DeviceRoot.h"
@@ -116,6 +117,10 @@ void writeFile(const std::filesystem::path& path, const std::string& text) {
     std::ofstream out(path, std::ofstream::binary | std::ofstream::trunc);
     out << text;
     if (!out) throw std::runtime_error("cannot write " + path.string());
+}
+
+void waitForDeathRowQueue() {
+    BTHDeathRowQueue()->sync([] {});
 }
 
 void writeDeviceProperties(const Value& properties) {

@@ -76,6 +76,10 @@ class LogCapture {
 // Writes `text` to `path`, creating or replacing it.
 void writeFile(const std::filesystem::path& path, const std::string& text);
 std::string readFile(const std::filesystem::path& path);
+// Waits until the death-row queue has run everything submitted to it so far:
+// a test program must not end while that queue still works on the scratch
+// root its statics are about to remove.
+void waitForDeathRowQueue();
 // Replaces the device-property file of the device root with `properties`
 // ("InternalBuild", "MultiUser", ...).
 void writeDeviceProperties(const Value& properties);

@@ -56,7 +56,10 @@ std::vector<std::string> stagingLeftovers() {
 class BTHCreateOrLookup : public ::testing::Test {
   protected:
     void SetUp() override { BERTH_REQUIRE_ROOT(); }
-    void TearDown() override { BTHFaultInjectionArm(""); }
+    void TearDown() override {
+        BTHFaultInjectionArm("");
+        test::waitForDeathRowQueue();
+    }
 };
 
 TEST_F(BTHCreateOrLookup, ConcurrentCreatesOfOneIdentifierMakeOneContainer) {

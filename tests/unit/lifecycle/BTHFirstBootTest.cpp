@@ -33,6 +33,7 @@ class BTHFirstBootTest : public ::testing::Test {
     void TearDown() override {
         test::writeDeviceProperties(dict({}));
         stdfs::remove_all(backupBase());
+        test::waitForDeathRowQueue();
     }
 
     BTHClientConnection& client() { return *BTHClientConnection::sharedClientConnection(); }
