@@ -31,6 +31,7 @@
 #include "platform/DeviceProperties.h"
 #include "platform/SafeFs.h"
 #include "platform/SandboxMappingStore.h"
+#include "platform/SyncTogether.h"
 
 namespace berth {
 
@@ -316,13 +317,7 @@ class CreateOrLookup {
     // file system the first sync here commits the whole tree at once.
     bool syncStaged(const std::filesystem::path& staging, BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
-        const std::filesystem::path library = staging / "Library";
-        std::error_code ignored;
-        int err = syncFile(BTHMetadata::metadataFileURL(staging));
-        if (err == 0 && std::filesystem::is_directory(library, ignored))
-            err = BTHDirectorySync::syncDirectory(library);
-        if (err == 0) err = BTHDirectorySync::syncDirectory(staging);
-        if (err == 0 && BTHFaultActive("create.sync-staged")) err = EIO;
+        const int err = BTHFaultActive("create.sync-staged") ? EIO : syncStagedItems(staging);
         if (err == 0) return true;
         BTHSetError(
             error,
@@ -332,10 +327,22 @@ class CreateOrLookup {
         return false;
     }
 
-    static int syncFile(const std::filesystem::path& path) {
-        UniqueFd fd = fs::openNoFollow(path, O_RDONLY);
-        if (!fd) return errno;
-        return ::fsync(fd.get()) == 0 ? 0 : errno;
+    // The metadata file, "Library" (when the class has one) and the
+    // container directory, synced together: one journal commit for all.
+    static int syncStagedItems(const std::filesystem::path& staging) {
+        std::vector<UniqueFd> items;
+        items.push_back(fs::openNoFollow(BTHMetadata::metadataFileURL(staging), O_RDONLY));
+        if (!items.back()) return errno;
+        UniqueFd library = fs::openNoFollow(staging / "Library", O_RDONLY | O_DIRECTORY);
+        if (library)
+            items.push_back(std::move(library));
+        else if (errno != ENOENT)
+            return errno;
+        items.push_back(fs::openNoFollow(staging, O_RDONLY | O_DIRECTORY));
+        if (!items.back()) return errno;
+        std::vector<int> fds;
+        for (const UniqueFd& item : items) fds.push_back(item.get());
+        return syncTogether(fds);
     }
 
     // Step 14: well-known system containers live under their fixed name.
