@@ -373,8 +373,9 @@ std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(const std::strin
         setWhy(why, reason);
         return std::nullopt;
     }
-    if (record->cgroup != cgroup || record->cgroupId != status.st_ino ||
-        record->identifier != origin.identifier) {
+    // A group's path never changes (cgroup v2 groups cannot be renamed), and
+    // its inode is never given to another group while the system runs.
+    if (record->cgroupId != status.st_ino || record->identifier != origin.identifier) {
         setWhy(why, "the launch record of " + origin.launch + " was made for another group");
         return std::nullopt;
     }

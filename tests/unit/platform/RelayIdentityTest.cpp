@@ -405,6 +405,14 @@ TEST_F(StartedIdentityTest, ALaunchCountsOnlyWithItsOwnRecordInGroupsOnlyRootCan
         {"an identifier group others can write",
          [&] { ASSERT_EQ(::chmod(identifierGroup.c_str(), 0777), 0); },
          [&] { ASSERT_EQ(::chmod(identifierGroup.c_str(), 0755), 0); }, "is not root's alone"},
+        {"the program signed as another identifier since",
+         [&] {
+             ASSERT_EQ(registry_->sign(signed_, "sys.kelp.test.renamed",
+                                       entitlementsAllowing("sys.kelp.private.Berth.allowed")),
+                       0);
+         },
+         [&] { sign(entitlementsAllowing("sys.kelp.private.Berth.allowed")); },
+         "no longer signed as it was launched"},
         {"the program's signature withdrawn", [&] { ASSERT_EQ(registry_->remove(signed_), 0); },
          [&] { sign(entitlementsAllowing("sys.kelp.private.Berth.allowed")); }, "no signature for"},
     };
