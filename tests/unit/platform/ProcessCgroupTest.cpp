@@ -75,6 +75,10 @@ TEST(ProcessCgroupTest, WhatAGroupSaysAboutHowItsProcessesStarted) {
          "user@501.service", 2},
         {"user.slice/user-501.slice/session-2.scope", Kind::Unit, "session-2.scope", 2},
         {"system.slice/cron.socket", Kind::Other, "", 0},
+        // Below a group that is neither slice nor unit, a unit's name means
+        // nothing.
+        {"berthd.launch/fake.service", Kind::Other, "", 0},
+        {"machine/system.slice/fake.service", Kind::Other, "", 0},
         {"user.slice", Kind::Other, "", 0},
         {"", Kind::Other, "", 0},
         {"system.slice//a.service", Kind::Other, "", 0},
@@ -137,6 +141,11 @@ TEST_F(TrustedCgroupTest, AProcessIsFoundInItsGroupThroughItsPidfd) {
     ASSERT_TRUE(pidfd);
     std::string why;
     EXPECT_EQ(cgroupOfProcess(pid, pidfd.get(), &why), launch->path) << why;
+    // A pid that another process than the pidfd's holds (as after reuse)
+    // does not answer for it.
+    UniqueFd ownPidfd(static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0)));
+    EXPECT_FALSE(cgroupOfProcess(pid, ownPidfd.get(), &why));
+    EXPECT_NE(why.find("pidfd refers to pid"), std::string::npos) << why;
     EXPECT_EQ(classifyCgroup(launch->path, parent_).kind, Kind::Launch);
     EXPECT_TRUE(cgroups_->holdsProcesses(launch->path, launch->id));
     EXPECT_FALSE(cgroups_->holdsProcesses(launch->path, launch->id + 1));
