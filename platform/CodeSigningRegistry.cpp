@@ -10,9 +10,10 @@
 #include <cstring>
 #include <memory>
 
-#include "core/Uuid.h"
 #include "platform/DeviceRoot.h"
+#include "platform/LaunchCgroup.h"
 #include "platform/PropertyList.h"
+#include "platform/RootOwnedFiles.h"
 #include "platform/SafeFs.h"
 
 namespace berth {
@@ -21,6 +22,7 @@ namespace {
 
 constexpr const char* kPathKey = "Path";
 constexpr const char* kDigestKey = "SHA256";
+constexpr const char* kUnitKey = "Unit";
 constexpr const char* kIdentifierKey = "Identifier";
 constexpr const char* kEntitlementsKey = "Entitlements";
 constexpr const char* kEntrySuffix = ".plist";
@@ -35,62 +37,6 @@ int fail(std::string* why, int error, std::string text) {
     return error;
 }
 
-// Root's alone: owned by uid 0 and writable by nobody else.
-bool isRootsAlone(const struct stat& status) {
-    return status.st_uid == 0 && (status.st_mode & (S_IWGRP | S_IWOTH)) == 0;
-}
-
-bool isBelow(const std::filesystem::path& path, const std::filesystem::path& root) {
-    const std::string p = path.string(), r = root.string();
-    if (r == "/") return p.size() > 1 && p[0] == '/';
-    return p.size() > r.size() && p.compare(0, r.size(), r) == 0 && p[r.size()] == '/';
-}
-
-bool readAll(int fd, std::vector<uint8_t>& bytes, size_t limit) {
-    uint8_t buffer[16384];
-    for (;;) {
-        ssize_t n = ::read(fd, buffer, sizeof buffer);
-        if (n < 0 && errno == EINTR) continue;
-        if (n < 0) return false;
-        if (n == 0) return true;
-        if (bytes.size() + static_cast<size_t>(n) > limit) {
-            errno = EFBIG;
-            return false;
-        }
-        bytes.insert(bytes.end(), buffer, buffer + n);
-    }
-}
-
-bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
-    size_t done = 0;
-    while (done < bytes.size()) {
-        ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
-        if (n < 0 && errno == EINTR) continue;
-        if (n < 0) return false;
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
-// Replaces `name` in `dirFd` with `bytes` so that a reader, or the next boot
-// after a crash, finds either the old file or the new one whole.
-int writeAtomically(int dirFd, const std::string& name, const std::vector<uint8_t>& bytes) {
-    const std::string temp = "." + name + "." + Uuid::random().string() + ".tmp";
-    UniqueFd fd(
-        ::openat(dirFd, temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
-    if (!fd) return errno;
-    int error = 0;
-    if (::fchmod(fd.get(), 0644) != 0 || !writeAll(fd.get(), bytes) || ::fsync(fd.get()) != 0)
-        error = errno;
-    fd.reset();
-    if (error == 0 && ::renameat(dirFd, temp.c_str(), dirFd, name.c_str()) != 0) error = errno;
-    if (error != 0) {
-        ::unlinkat(dirFd, temp.c_str(), 0);
-        return error;
-    }
-    return ::fsync(dirFd) == 0 ? 0 : errno;
-}
-
 std::optional<Sha256Digest> digestFromValue(const Value* value) {
     if (!value || !value->data() || value->data()->size() != Sha256Digest().size())
         return std::nullopt;
@@ -101,27 +47,40 @@ std::optional<Sha256Digest> digestFromValue(const Value* value) {
 
 std::optional<SignatureEntry> entryFromValue(const Value& dictionary, std::string* why) {
     const Value* path = dictionary.find(kPathKey);
+    const Value* unit = dictionary.find(kUnitKey);
     const Value* identifier = dictionary.find(kIdentifierKey);
     const Value* entitlements = dictionary.find(kEntitlementsKey);
     std::optional<Sha256Digest> digest = digestFromValue(dictionary.find(kDigestKey));
-    if (!path || !path->string() || !std::filesystem::path(*path->string()).is_absolute()) {
+    std::string unitError;
+    if (unit && path) {
+        setWhy(why, "names both a unit and a path");
+    } else if (unit && (!unit->string() || !isServiceUnitName(*unit->string(), &unitError))) {
+        setWhy(why, "no valid \"Unit\"");
+    } else if (!unit && (!path || !path->string() ||
+                         !std::filesystem::path(*path->string()).is_absolute())) {
         setWhy(why, "no absolute \"Path\"");
-    } else if (!digest) {
+    } else if (!unit && !digest) {
         setWhy(why, "no 32-byte \"SHA256\"");
     } else if (!identifier || !identifier->string() || identifier->string()->empty()) {
         setWhy(why, "no \"Identifier\"");
     } else if (!entitlements || !entitlements->isDictionary()) {
         setWhy(why, "no \"Entitlements\" dictionary");
+    } else if (unit) {
+        return SignatureEntry{{}, {}, *unit->string(), *identifier->string(), *entitlements};
     } else {
-        return SignatureEntry{*path->string(), *digest, *identifier->string(), *entitlements};
+        return SignatureEntry{*path->string(), *digest, {}, *identifier->string(), *entitlements};
     }
     return std::nullopt;
 }
 
 Value entryToValue(const SignatureEntry& entry) {
     Value dictionary = Value::dictionary();
-    dictionary.set(kPathKey, entry.executablePath.string());
-    dictionary.set(kDigestKey, Value::Data(entry.digest.begin(), entry.digest.end()));
+    if (entry.isUnit()) {
+        dictionary.set(kUnitKey, entry.unit);
+    } else {
+        dictionary.set(kPathKey, entry.executablePath.string());
+        dictionary.set(kDigestKey, Value::Data(entry.digest.begin(), entry.digest.end()));
+    }
     dictionary.set(kIdentifierKey, entry.identifier);
     dictionary.set(kEntitlementsKey, entry.entitlements);
     return dictionary;
@@ -144,92 +103,62 @@ CodeSigningRegistry::CodeSigningRegistry() : CodeSigningRegistry(Options{}) {}
 CodeSigningRegistry::CodeSigningRegistry(Options options)
     : directory_(options.directory.empty() ? defaultDirectory()
                                            : options.directory.lexically_normal()),
+      launches_(std::move(options.launchRecordDirectory)),
+      launchCgroupParent_(options.launchCgroupParent.empty() ? LaunchCgroup::configuredParent()
+                                                             : options.launchCgroupParent),
       digests_(options.digestCacheCapacity, options.racyWindow) {}
 
-std::string CodeSigningRegistry::entryFileName(const std::filesystem::path& executablePath) {
-    const std::string& text = executablePath.native();
-    return hexString(sha256({reinterpret_cast<const uint8_t*>(text.data()), text.size()})) +
+std::string CodeSigningRegistry::entryFileName(const std::string& key) {
+    return hexString(sha256({reinterpret_cast<const uint8_t*>(key.data()), key.size()})) +
            kEntrySuffix;
 }
 
-// Opens the registry directory, walking from the trusted prefix (the device
-// root, or "/" for a directory outside it) one component at a time without
-// following links, and refusing any component that is not root's alone.
 UniqueFd CodeSigningRegistry::openTrustedDirectory(bool create, std::string* why,
                                                    int* error) const {
-    const std::filesystem::path& root = DeviceRoot::path();
-    const std::filesystem::path prefix = isBelow(directory_, root) ? root : "/";
-    std::filesystem::path walked = prefix;
-    auto failed = [&](int errnum, std::string text) {
-        *error = fail(why, errnum, std::move(text));
-        return UniqueFd();
-    };
-    UniqueFd current(::open(prefix.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-    if (!current) return failed(errno, "cannot open " + prefix.string());
-    for (const auto& component : directory_.lexically_relative(prefix)) {
-        if (component == "." || component.empty()) continue;
-        if (component == "..") return failed(EINVAL, "the registry path may not contain \"..\"");
-        walked /= component;
-        const int flags = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
-        UniqueFd next(::openat(current.get(), component.c_str(), flags));
-        if (!next && errno == ENOENT && create &&
-            (::mkdirat(current.get(), component.c_str(), 0755) == 0 || errno == EEXIST))
-            next.reset(::openat(current.get(), component.c_str(), flags));
-        struct stat status {};
-        if (!next || ::fstat(next.get(), &status) != 0) {
-            const int errnum = errno;
-            return failed(errnum, "cannot open " + walked.string() + ": " + strerror(errnum));
-        }
-        if (!isRootsAlone(status)) return failed(EPERM, walked.string() + " is not root's alone");
-        current = std::move(next);
-    }
-    UniqueFd directory(::openat(current.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directory) {
-        const int errnum = errno;
-        return failed(errnum, "cannot open " + walked.string() + ": " + strerror(errnum));
-    }
+    std::string reason;
+    UniqueFd directory = openRootOwnedDirectory(directory_, create, &reason, error, 0755);
+    if (!directory) setWhy(why, std::move(reason));
     return directory;
 }
 
 std::optional<SignatureEntry> CodeSigningRegistry::readEntry(int dirFd, const std::string& fileName,
                                                              std::string* why,
                                                              bool* missing) const {
-    UniqueFd fd(::openat(dirFd, fileName.c_str(),
-                         O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    struct stat status {};
-    if (!fd || ::fstat(fd.get(), &status) != 0) {
-        const int error = errno;
-        if (missing) *missing = error == ENOENT;
-        setWhy(why, error == ELOOP ? "is a symbolic link" : strerror(error));
-        return std::nullopt;
-    }
-    if (!S_ISREG(status.st_mode)) {
-        setWhy(why, "is not a regular file");
-        return std::nullopt;
-    }
-    if (!isRootsAlone(status)) {
-        setWhy(why, "is not root's alone (owner or mode)");
-        return std::nullopt;
-    }
-    std::vector<uint8_t> bytes;
-    if (!readAll(fd.get(), bytes, kMaxEntryBytes)) {
-        const int error = errno;
-        setWhy(why, std::string("cannot be read: ") + strerror(error));
+    std::string reason;
+    const std::optional<std::vector<uint8_t>> bytes =
+        readRootOwnedFile(dirFd, fileName, kMaxEntryBytes, &reason, missing);
+    if (!bytes) {
+        setWhy(why, std::move(reason));
         return std::nullopt;
     }
     std::string parseError;
-    std::optional<Value> dictionary = plist::parse(bytes, &parseError);
+    std::optional<Value> dictionary = plist::parse(*bytes, &parseError);
     if (!dictionary || !dictionary->isDictionary()) {
         setWhy(why, "is not a property-list dictionary" +
                         (parseError.empty() ? std::string() : ": " + parseError));
         return std::nullopt;
     }
     std::optional<SignatureEntry> entry = entryFromValue(*dictionary, why);
-    if (entry && entryFileName(entry->executablePath) != fileName) {
-        setWhy(why, "names another executable (" + entry->executablePath.string() + ")");
+    if (entry && entryFileName(entry->key()) != fileName) {
+        setWhy(why, "names another " + std::string(entry->isUnit() ? "unit" : "executable") + " (" +
+                        entry->key() + ")");
         return std::nullopt;
     }
     return entry;
+}
+
+int CodeSigningRegistry::writeEntry(const SignatureEntry& entry, std::string* why) {
+    std::string encodeError;
+    std::optional<std::vector<uint8_t>> bytes =
+        plist::serializeBinary(entryToValue(entry), &encodeError);
+    if (!bytes) return fail(why, EINVAL, "the entitlements cannot be stored: " + encodeError);
+    int error = 0;
+    UniqueFd directory = openTrustedDirectory(true, why, &error);
+    if (!directory) return error;
+    error = replaceFileAtomically(directory.get(), entryFileName(entry.key()), *bytes);
+    if (error != 0)
+        return fail(why, error, std::string("cannot write the entry: ") + strerror(error));
+    return 0;
 }
 
 int CodeSigningRegistry::sign(const std::filesystem::path& executablePath,
@@ -244,7 +173,7 @@ int CodeSigningRegistry::sign(const std::filesystem::path& executablePath,
 
     std::error_code resolveError;
     SignatureEntry entry{
-        std::filesystem::canonical(executablePath, resolveError), {}, identifier, entitlements};
+        std::filesystem::canonical(executablePath, resolveError), {}, {}, identifier, entitlements};
     if (resolveError)
         return fail(why, resolveError.value(),
                     executablePath.string() + ": " + resolveError.message());
@@ -259,19 +188,35 @@ int CodeSigningRegistry::sign(const std::filesystem::path& executablePath,
     std::optional<Sha256Digest> digest = sha256OfFile(file.get(), why);
     if (!digest) return EIO;
     entry.digest = *digest;
-
-    std::string encodeError;
-    std::optional<std::vector<uint8_t>> bytes =
-        plist::serializeBinary(entryToValue(entry), &encodeError);
-    if (!bytes) return fail(why, EINVAL, "the entitlements cannot be stored: " + encodeError);
-    int error = 0;
-    UniqueFd directory = openTrustedDirectory(true, why, &error);
-    if (!directory) return error;
-    error = writeAtomically(directory.get(), entryFileName(entry.executablePath), *bytes);
-    if (error != 0)
-        return fail(why, error, std::string("cannot write the entry: ") + strerror(error));
+    if (const int error = writeEntry(entry, why)) return error;
     if (written) *written = std::move(entry);
     return 0;
+}
+
+int CodeSigningRegistry::signUnit(const std::string& unit, const std::string& identifier,
+                                  const Value& entitlements, std::string* why,
+                                  SignatureEntry* written) {
+    if (::geteuid() != 0) return fail(why, EPERM, "only root may sign units");
+    std::string reason;
+    if (!isServiceUnitName(unit, &reason)) return fail(why, EINVAL, reason);
+    if (identifier.empty()) return fail(why, EINVAL, "the identifier is empty");
+    if (!entitlements.isDictionary())
+        return fail(why, EINVAL, "the entitlements must be a dictionary");
+    SignatureEntry entry{{}, {}, unit, identifier, entitlements};
+    if (const int error = writeEntry(entry, why)) return error;
+    if (written) *written = std::move(entry);
+    return 0;
+}
+
+int CodeSigningRegistry::removeByKey(const std::string& key, std::string* why) {
+    int error = 0;
+    UniqueFd directory = openTrustedDirectory(false, why, &error);
+    if (!directory) return error;
+    if (::unlinkat(directory.get(), entryFileName(key).c_str(), 0) != 0) {
+        error = errno;
+        return fail(why, error, error == ENOENT ? "no signature for " + key : strerror(error));
+    }
+    return ::fsync(directory.get()) == 0 ? 0 : errno;
 }
 
 int CodeSigningRegistry::remove(const std::filesystem::path& executablePath, std::string* why) {
@@ -282,15 +227,14 @@ int CodeSigningRegistry::remove(const std::filesystem::path& executablePath, std
     std::filesystem::path resolved =
         std::filesystem::weakly_canonical(executablePath, resolveError);
     if (resolveError) resolved = executablePath.lexically_normal();
-    int error = 0;
-    UniqueFd directory = openTrustedDirectory(false, why, &error);
-    if (!directory) return error;
-    if (::unlinkat(directory.get(), entryFileName(resolved).c_str(), 0) != 0) {
-        error = errno;
-        return fail(why, error,
-                    error == ENOENT ? "no signature for " + resolved.string() : strerror(error));
-    }
-    return ::fsync(directory.get()) == 0 ? 0 : errno;
+    return removeByKey(resolved.string(), why);
+}
+
+int CodeSigningRegistry::removeUnit(const std::string& unit, std::string* why) {
+    if (::geteuid() != 0) return fail(why, EPERM, "only root may remove signatures");
+    std::string reason;
+    if (!isServiceUnitName(unit, &reason)) return fail(why, EINVAL, reason);
+    return removeByKey(unit, why);
 }
 
 CodeSigningRegistry::Listing CodeSigningRegistry::list() const {
@@ -315,27 +259,46 @@ CodeSigningRegistry::Listing CodeSigningRegistry::list() const {
             listing.ignored.push_back({item->d_name, why});
     }
     std::sort(listing.entries.begin(), listing.entries.end(),
-              [](const auto& a, const auto& b) { return a.executablePath < b.executablePath; });
+              [](const auto& a, const auto& b) { return a.key() < b.key(); });
     return listing;
 }
 
-std::optional<SignatureEntry> CodeSigningRegistry::entryFor(
-    const std::filesystem::path& executablePath, std::string* why) const {
+std::optional<SignatureEntry> CodeSigningRegistry::entryByKey(const std::string& key,
+                                                              std::string* why) const {
     int error = 0;
     UniqueFd directory = openTrustedDirectory(false, why, &error);
     if (!directory) {
-        if (error == ENOENT) setWhy(why, "no signature for " + executablePath.string());
+        if (error == ENOENT) setWhy(why, "no signature for " + key);
         return std::nullopt;
     }
-    const std::string fileName = entryFileName(executablePath);
+    const std::string fileName = entryFileName(key);
     std::string reason;
     bool missing = false;
     std::optional<SignatureEntry> entry = readEntry(directory.get(), fileName, &reason, &missing);
     if (!entry) {
-        setWhy(why, missing ? "no signature for " + executablePath.string()
-                            : "the signature of " + executablePath.string() + " (" + fileName +
-                                  ") is ignored: it " + reason);
+        setWhy(why, missing ? "no signature for " + key
+                            : "the signature of " + key + " (" + fileName + ") is ignored: it " +
+                                  reason);
     }
+    return entry;
+}
+
+std::optional<SignatureEntry> CodeSigningRegistry::entryFor(
+    const std::filesystem::path& executablePath, std::string* why) const {
+    std::optional<SignatureEntry> entry = entryByKey(executablePath.string(), why);
+    if (entry && entry->isUnit()) return std::nullopt;  // never: file names differ
+    return entry;
+}
+
+std::optional<SignatureEntry> CodeSigningRegistry::entryForUnit(const std::string& unit,
+                                                                std::string* why) const {
+    std::string reason;
+    if (!isServiceUnitName(unit, &reason)) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    std::optional<SignatureEntry> entry = entryByKey(unit, why);
+    if (entry && !entry->isUnit()) return std::nullopt;  // never: file names differ
     return entry;
 }
 
@@ -357,6 +320,97 @@ std::optional<PeerIdentity> CodeSigningRegistry::identify(pid_t pid, int pidfd, 
 std::optional<ExecutableId> CodeSigningRegistry::executableOf(pid_t pid, int pidfd,
                                                               std::string* why) {
     return runningExecutable(pid, pidfd, why);
+}
+
+std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunched(pid_t pid, int pidfd, uid_t uid,
+                                                                  std::string* why) {
+    std::string reason;
+    const std::optional<std::string> cgroup = cgroupOfProcess(pid, pidfd, &reason);
+    if (!cgroup) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    const CgroupOrigin origin = classifyCgroup(*cgroup, launchCgroupParent_);
+    const char* notStarted = " was neither launched by berth-launch nor started as a bound unit";
+    if (origin.kind == CgroupOrigin::Kind::Other) {
+        setWhy(why,
+               "pid " + std::to_string(pid) + " (control group /" + *cgroup + ")" + notStarted);
+        return std::nullopt;
+    }
+    const std::optional<std::filesystem::path> mount = cgroup2Mount(&reason);
+    if (!mount) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    return origin.kind == CgroupOrigin::Kind::Launch
+               ? identifyLaunch(*cgroup, origin, uid, *mount, why)
+               : identifyUnit(*cgroup, origin, *mount, why);
+}
+
+std::optional<std::filesystem::path> CodeSigningRegistry::cgroup2Mount(std::string* why) const {
+    std::lock_guard lock(mountMutex_);
+    if (!mount_) mount_ = LaunchCgroup::cgroup2Mount(why);
+    return mount_;
+}
+
+// A launch is believed when its group can have been filled by root alone,
+// its record is the one made for this very group, and the program the
+// launcher checked is still signed as it was then.
+std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(const std::string& cgroup,
+                                                                const CgroupOrigin& origin,
+                                                                uid_t uid,
+                                                                const std::filesystem::path& mount,
+                                                                std::string* why) const {
+    std::string reason;
+    const UniqueFd group = openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason);
+    struct stat status {};
+    if (!group || ::fstat(group.get(), &status) != 0) {
+        setWhy(why, reason.empty() ? "cannot open the control group /" + cgroup : reason);
+        return std::nullopt;
+    }
+    const std::optional<LaunchRecord> record = launches_.read(origin.launch, &reason);
+    if (!record) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    // A group's path never changes (cgroup v2 groups cannot be renamed), and
+    // its inode is never given to another group while the system runs.
+    if (record->cgroupId != status.st_ino || record->identifier != origin.identifier) {
+        setWhy(why, "the launch record of " + origin.launch + " was made for another group");
+        return std::nullopt;
+    }
+    if (record->persona != uid) {
+        setWhy(why, "the launch " + origin.launch + " runs as uid " +
+                        std::to_string(record->persona) + ", not " + std::to_string(uid));
+        return std::nullopt;
+    }
+    std::optional<SignatureEntry> entry = entryFor(record->executablePath, &reason);
+    if (!entry) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    if (entry->identifier != record->identifier || entry->digest != record->digest) {
+        setWhy(why, record->executablePath.string() + " is no longer signed as it was launched");
+        return std::nullopt;
+    }
+    return PeerIdentity{std::move(entry->identifier), std::move(entry->entitlements), {}, {}};
+}
+
+std::optional<PeerIdentity> CodeSigningRegistry::identifyUnit(const std::string& cgroup,
+                                                              const CgroupOrigin& origin,
+                                                              const std::filesystem::path& mount,
+                                                              std::string* why) const {
+    std::string reason;
+    if (!openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason)) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    std::optional<SignatureEntry> entry = entryForUnit(origin.unit, &reason);
+    if (!entry) {
+        setWhy(why, reason);
+        return std::nullopt;
+    }
+    return PeerIdentity{std::move(entry->identifier), std::move(entry->entitlements), {}, {}};
 }
 
 }  // namespace berth

@@ -1,5 +1,6 @@
 #include "platform/LaunchCgroup.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
@@ -9,10 +10,12 @@
 #include <cerrno>
 #include <cstdlib>
 #include <fstream>
+#include <memory>
 #include <sstream>
 #include <thread>
 #include <vector>
 
+#include "core/Uuid.h"
 #include "platform/SafeFs.h"
 
 namespace berth {
@@ -78,6 +81,35 @@ void killListed(int groupFd) {
         if (pid > 0) ::kill(pid, SIGKILL);
 }
 
+// Sends SIGKILL to every process the group and its launch groups list now.
+// Launch groups are leaves: only root can make groups there.
+void killListedWithLaunches(int groupFd) {
+    killListed(groupFd);
+    UniqueFd forReading(::openat(groupFd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    std::unique_ptr<DIR, int (*)(DIR*)> stream(forReading ? ::fdopendir(forReading.get()) : nullptr,
+                                               ::closedir);
+    if (!stream) return;
+    forReading.release();
+    while (const struct dirent* item = ::readdir(stream.get())) {
+        if (item->d_type != DT_DIR || item->d_name[0] == '.') continue;
+        UniqueFd launch(
+            ::openat(groupFd, item->d_name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (launch) killListed(launch.get());
+    }
+}
+
+// 32 random lower-case hexadecimal digits.
+std::string randomLaunchName() {
+    static constexpr char kHex[] = "0123456789abcdef";
+    std::string name;
+    const Uuid random = Uuid::random();
+    for (uint8_t byte : random.bytes()) {
+        name.push_back(kHex[byte >> 4]);
+        name.push_back(kHex[byte & 0xF]);
+    }
+    return name;
+}
+
 // Waits up to `wait` for the events file to change.
 void awaitEvents(int groupFd, std::chrono::milliseconds wait) {
     UniqueFd events(::openat(groupFd, "cgroup.events", O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
@@ -120,6 +152,18 @@ std::string LaunchCgroup::configuredParent() {
     return configured && *configured ? configured : kDefaultParent;
 }
 
+std::optional<std::filesystem::path> LaunchCgroup::cgroup2Mount(std::string* why) {
+    std::ifstream in("/proc/self/mountinfo");
+    std::stringstream mountinfo;
+    mountinfo << in.rdbuf();
+    std::optional<std::filesystem::path> mount = BTHCgroup2MountIn(mountinfo.str());
+    if (!mount)
+        *why =
+            "no cgroup v2 (unified) hierarchy is mounted (no cgroup2 entry in "
+            "/proc/self/mountinfo)";
+    return mount;
+}
+
 std::optional<LaunchCgroup> LaunchCgroup::locate(const std::string& parent, std::string* why,
                                                  bool* unmounted) {
     if (unmounted) *unmounted = false;
@@ -131,17 +175,14 @@ std::optional<LaunchCgroup> LaunchCgroup::locate(const std::string& parent, std:
                "\" is not a relative path inside the cgroup2 hierarchy";
         return std::nullopt;
     }
-    std::ifstream in("/proc/self/mountinfo");
-    std::stringstream mountinfo;
-    mountinfo << in.rdbuf();
-    const std::optional<std::filesystem::path> mount = BTHCgroup2MountIn(mountinfo.str());
+    const std::optional<std::filesystem::path> mount = cgroup2Mount(why);
     if (!mount) {
-        *why =
-            "no cgroup v2 (unified) hierarchy is mounted (no cgroup2 entry in "
-            "/proc/self/mountinfo)";
+        if (unmounted) *unmounted = true;
         return std::nullopt;
     }
-    return LaunchCgroup(*mount / relative);
+    std::string normal = relative.lexically_normal().string();
+    while (normal.size() > 1 && normal.back() == '/') normal.pop_back();
+    return LaunchCgroup(*mount, normal);
 }
 
 bool LaunchCgroup::validName(std::string_view identifier, std::string* why) {
@@ -172,6 +213,45 @@ UniqueFd LaunchCgroup::create(const std::string& identifier) const {
     return fs::openAtNoFollow(parent.get(), identifier.c_str(), O_RDONLY | O_DIRECTORY);
 }
 
+std::optional<LaunchGroup> LaunchCgroup::createLaunch(const std::string& identifier) const {
+    // A launcher of the same identifier that ends meanwhile may remove the
+    // identifier's group between its making here and the launch group's:
+    // then the identifier's group is made again.
+    for (int attempt = 0; attempt < 8; ++attempt) {
+        const UniqueFd group = create(identifier);
+        if (!group) return std::nullopt;
+        LaunchGroup launch;
+        launch.name = randomLaunchName();
+        if (::mkdirat(group.get(), launch.name.c_str(), 0755) != 0) {
+            if (errno == ENOENT) continue;
+            return std::nullopt;
+        }
+        launch.fd = fs::openAtNoFollow(group.get(), launch.name.c_str(), O_RDONLY | O_DIRECTORY);
+        struct stat status {};
+        if (!launch.fd || ::fstat(launch.fd.get(), &status) != 0) return std::nullopt;
+        launch.id = status.st_ino;
+        launch.path = relative_ + "/" + identifier + "/" + launch.name;
+        return launch;
+    }
+    errno = ENOENT;
+    return std::nullopt;
+}
+
+int LaunchCgroup::removeLaunch(const std::string& identifier, const std::string& launch) const {
+    std::string why;
+    if (!validName(identifier, &why) || !validName(launch, &why)) return EINVAL;
+    UniqueFd group = openGroup(pathOf(identifier));
+    if (!group) return errno;
+    return ::unlinkat(group.get(), launch.c_str(), AT_REMOVEDIR) == 0 ? 0 : errno;
+}
+
+bool LaunchCgroup::holdsProcesses(const std::string& path, uint64_t id) const {
+    const UniqueFd group = openGroup(mount_ / path);
+    struct stat status {};
+    return group && ::fstat(group.get(), &status) == 0 && status.st_ino == id &&
+           populatedAt(group.get());
+}
+
 int LaunchCgroup::join(int groupFd) {
     return writeAt(groupFd, "cgroup.procs", std::to_string(::getpid()));
 }
@@ -186,7 +266,7 @@ int LaunchCgroup::killAll(const std::string& identifier, std::chrono::millisecon
     const bool killFile = useKillFile && ::faccessat(group.get(), "cgroup.kill", F_OK, 0) == 0 &&
                           writeAt(group.get(), "cgroup.kill", "1") == 0;
     while (populatedAt(group.get())) {
-        if (!killFile) killListed(group.get());
+        if (!killFile) killListedWithLaunches(group.get());
         if (std::chrono::steady_clock::now() >= deadline) return ETIMEDOUT;
         awaitEvents(group.get(), std::chrono::milliseconds(20));
     }

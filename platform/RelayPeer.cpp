@@ -79,12 +79,43 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
         return peer;
     }
     peer.pidfd_ = peerPidfd(fd, cred, &peer.unboundReason_);
-    if (!peer.pidfd_) return peer;
+    if (!peer.pidfd_ || peer.uid_ != 0) return peer;
     peer.bound_ = peer.signing_->executableOf(peer.pid_, peer.pidfd_.get(), &peer.unboundReason_);
     return peer;
 }
 
 RelayPeerIdentity RelayPeer::identity() const {
+    return uid_ == 0 ? executableIdentity() : launchedIdentity();
+}
+
+RelayPeerIdentity RelayPeer::launchedIdentity() const {
+    RelayPeerIdentity identity;
+    identity.pid = pid_;
+    identity.effectiveUserId = uid_;
+    identity.groupId = gid_;
+    if (!pidfd_) {
+        identity.signingError = unboundReason_;
+        return identity;
+    }
+    std::string why;
+    if (std::optional<PeerIdentity> started =
+            signing_->identifyLaunched(pid_, pidfd_.get(), uid_, &why)) {
+        identity.processStillBound = true;
+        identity.signingIdentifier = std::move(started->identifier);
+        identity.entitlements = std::move(started->entitlements);
+        return identity;
+    }
+    std::string gone;
+    if (!pidfdRefersTo(pidfd_.get(), pid_, &gone)) {
+        identity.signingError = "the connecting process has exited (" + gone + ")";
+        return identity;
+    }
+    identity.processStillBound = true;
+    identity.signingError = why;
+    return identity;
+}
+
+RelayPeerIdentity RelayPeer::executableIdentity() const {
     RelayPeerIdentity identity;
     identity.pid = pid_;
     identity.effectiveUserId = uid_;

@@ -6,22 +6,25 @@
 //     peer connected;
 //   - a pidfd of that process, from SO_PEERPIDFD (on kernels without it,
 //     pidfd_open(pid) confirmed against the credentials), so that a pid
-//     recycled after the peer exits cannot stand in for it;
-//   - the executable the process ran when its connection was accepted
-//     (device and inode), bound to the connection for its whole life.
+//     recycled after the peer exits cannot stand in for it.
 //
 // The peer's signing identity (identifier and entitlements) is evaluated
-// anew for every request through the code-signing service. It is believed
-// only while the connecting process is alive and still runs the executable
-// bound at accept: a process that execs another program, or that exits
-// after passing its socket to another process, leaves a connection with no
-// identity at all, and every request on it must be refused.
+// anew for every request through the code-signing service, and only while
+// the process that connected is alive: a socket that outlives it, passed to
+// another process, carries no identity at all, and every request on it must
+// be refused. How the identity is found depends on the uid the peer
+// connected with:
 //
-// Limit: the executable is bound when the daemon accepts the connection, not
-// at the instant of connect(). A process that connects and execs before the
-// daemon got round to accepting is bound to the program it exec'd. The
-// daemon accepts as soon as a connection is queued, which keeps that window
-// short; the kernel offers no exec counter that would close it.
+//   - root (uid 0) is trusted, and is the executable it runs: the file is
+//     bound to the connection at accept (not at connect(), which only a root
+//     process's own exec could exploit), and a peer that has exec'd another
+//     program since has no identity;
+//   - any other user is who its process was started as (launched by
+//     berth-launch, or a process of a unit bound to an entry), whatever it
+//     runs now: on Linux neither the executable of a non-root process nor
+//     its pid across exec says which code is speaking (see ProcessCgroup.h).
+//     Everything such a process forks or execs keeps its identity, as a
+//     sandboxed app's children do, and nothing else can take it on.
 #pragma once
 
 #include <sys/types.h>
@@ -42,12 +45,12 @@ struct RelayPeerIdentity {
     pid_t pid = 0;
     uid_t effectiveUserId = 0;
     gid_t groupId = 0;
-    // False when the connecting process has exited or now runs another
-    // executable than the one bound at accept: the peer then has no
+    // False when the connecting process has exited, or (root's) now runs
+    // another executable than the one bound at accept: the peer then has no
     // identity, and `signingError` says why.
     bool processStillBound = false;
     // The signing identifier and the whole entitlements dictionary; both
-    // absent when the executable has no signature (`signingError` says why).
+    // absent when the peer has no signature (`signingError` says why).
     std::optional<std::string> signingIdentifier;
     std::optional<Value> entitlements;
     std::string signingError;
@@ -55,10 +58,10 @@ struct RelayPeerIdentity {
 
 class RelayPeer {
   public:
-    // Establishes the credentials, pidfd and bound executable of the peer of
-    // the connected socket `fd`. Fails (nullopt, with the reason) only when
-    // the kernel gives no credentials; a peer whose pidfd or executable
-    // cannot be had is kept, with no identity.
+    // Establishes the credentials, pidfd and (for root) bound executable of
+    // the peer of the connected socket `fd`. Fails (nullopt, with the reason)
+    // only when the kernel gives no credentials; a peer whose pidfd or
+    // executable cannot be had is kept, with no identity.
     static std::optional<RelayPeer> ofSocket(int fd, std::shared_ptr<CodeSigningService> signing,
                                              std::string* why = nullptr);
 
@@ -77,12 +80,15 @@ class RelayPeer {
   private:
     RelayPeer() = default;
 
+    RelayPeerIdentity executableIdentity() const;
+    RelayPeerIdentity launchedIdentity() const;
+
     pid_t pid_ = 0;
     uid_t uid_ = 0;
     gid_t gid_ = 0;
     UniqueFd pidfd_;
-    std::optional<ExecutableId> bound_;
-    std::string unboundReason_;  // why bound_ is empty
+    std::optional<ExecutableId> bound_;  // root's peers only
+    std::string unboundReason_;          // why there is no identity to be had
     std::shared_ptr<CodeSigningService> signing_;
 };
 

@@ -15,18 +15,30 @@ namespace {
 
 Value entryValue(const SignatureEntry& entry) {
     Value value = Value::dictionary();
-    value.set("path", entry.executablePath.string());
+    if (entry.isUnit()) {
+        value.set("unit", entry.unit);
+    } else {
+        value.set("path", entry.executablePath.string());
+        value.set("sha256", hexString(entry.digest));
+    }
     value.set("identifier", entry.identifier);
-    value.set("sha256", hexString(entry.digest));
     value.set("entitlements", entry.entitlements);
     return value;
 }
 
 void printEntry(const SignatureEntry& entry, std::ostream& out) {
-    out << entry.executablePath.string() << "\n"
-        << "    identifier    " << entry.identifier << "\n"
-        << "    sha256        " << hexString(entry.digest) << "\n"
-        << "    entitlements  " << valueToJson(entry.entitlements) << "\n";
+    if (entry.isUnit())
+        out << "unit " << entry.unit << "\n";
+    else
+        out << entry.executablePath.string() << "\n";
+    out << "    identifier    " << entry.identifier << "\n";
+    if (!entry.isUnit()) out << "    sha256        " << hexString(entry.digest) << "\n";
+    out << "    entitlements  " << valueToJson(entry.entitlements) << "\n";
+}
+
+// What the command is about, as the messages name it.
+std::string subjectOf(const SignOptions& options, const std::filesystem::path& executable) {
+    return options.unit.empty() ? executable.string() : "the unit " + options.unit;
 }
 
 // The reason an errno value gives, with the registry's own account of it.
@@ -74,8 +86,13 @@ int sign(const SignOptions& options, const std::filesystem::path& executable, st
     }
     CodeSigningRegistry registry;
     SignatureEntry written;
-    if (int error = registry.sign(executable, options.identifier, *entitlements, &why, &written)) {
-        err << "error: cannot sign " << executable.string() << ": " << failure(error, why) << "\n";
+    const int error =
+        options.unit.empty()
+            ? registry.sign(executable, options.identifier, *entitlements, &why, &written)
+            : registry.signUnit(options.unit, options.identifier, *entitlements, &why, &written);
+    if (error != 0) {
+        err << "error: cannot sign " << subjectOf(options, executable) << ": "
+            << failure(error, why) << "\n";
         return kExitFailure;
     }
     if (options.json) {
@@ -91,17 +108,19 @@ int remove(const SignOptions& options, const std::filesystem::path& executable, 
            std::ostream& err) {
     CodeSigningRegistry registry;
     std::string why;
-    if (int error = registry.remove(executable, &why)) {
-        err << "error: cannot remove the signature of " << executable.string() << ": "
+    const int error = options.unit.empty() ? registry.remove(executable, &why)
+                                           : registry.removeUnit(options.unit, &why);
+    if (error != 0) {
+        err << "error: cannot remove the signature of " << subjectOf(options, executable) << ": "
             << failure(error, why) << "\n";
         return kExitFailure;
     }
     if (options.json) {
         Value result = Value::dictionary();
-        result.set("removed", executable.string());
+        result.set("removed", options.unit.empty() ? executable.string() : options.unit);
         out << valueToJson(result) << "\n";
     } else {
-        out << "removed the signature of " << executable.string() << "\n";
+        out << "removed the signature of " << subjectOf(options, executable) << "\n";
     }
     return kExitSuccess;
 }
@@ -117,7 +136,9 @@ int runSign(const SignOptions& options, std::ostream& out, std::ostream& err) {
         return kExitFailure;
     }
     std::error_code ec;
-    const std::filesystem::path executable = std::filesystem::absolute(options.executable, ec);
+    const std::filesystem::path executable = options.unit.empty()
+                                                 ? std::filesystem::absolute(options.executable, ec)
+                                                 : std::filesystem::path();
     if (ec) {
         err << "error: " << options.executable.string() << ": " << ec.message() << "\n";
         return kExitFailure;

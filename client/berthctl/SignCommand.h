@@ -12,6 +12,7 @@ struct SignOptions {
     enum class Action { Sign, Remove, List };
     Action action = Action::Sign;
     std::filesystem::path executable;  // Sign, Remove; relative to the working directory
+    std::string unit;                  // Sign, Remove: a unit instead of an executable
     std::string identifier;            // Sign
     std::string entitlements = "{}";   // Sign: typed JSON, must be a dictionary
     bool json = false;

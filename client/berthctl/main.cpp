@@ -322,20 +322,30 @@ void validateSign(Arguments& args) {
     sign.action = args.signList     ? SignOptions::Action::List
                   : args.signRemove ? SignOptions::Action::Remove
                                     : SignOptions::Action::Sign;
-    const bool hasPath = !sign.executable.empty();
+    if (!sign.unit.empty()) {
+        // With --unit the one positional is the identifier.
+        if (sign.identifier.empty())
+            sign.identifier = sign.executable.string();
+        else
+            throw CLI::ValidationError("sign", "--unit takes no executable");
+        sign.executable.clear();
+    }
+    const bool hasPath = !sign.executable.empty() || !sign.unit.empty();
     const bool hasIdentifier = !sign.identifier.empty();
     switch (sign.action) {
         case SignOptions::Action::List:
             if (hasPath || hasIdentifier)
-                throw CLI::ValidationError("sign", "--list takes no executable or identifier");
+                throw CLI::ValidationError("sign",
+                                           "--list takes no executable, unit or identifier");
             break;
         case SignOptions::Action::Remove:
             if (!hasPath || hasIdentifier)
-                throw CLI::ValidationError("sign", "--remove takes the executable alone");
+                throw CLI::ValidationError("sign", "--remove takes the executable or unit alone");
             break;
         case SignOptions::Action::Sign:
             if (!hasPath || !hasIdentifier)
-                throw CLI::ValidationError("sign", "give the executable and its identifier");
+                throw CLI::ValidationError(
+                    "sign", "give the executable (or --unit NAME) and its identifier");
             break;
     }
 }
@@ -364,9 +374,11 @@ int main(int argc, char** argv) {
         app.add_subcommand("sign", "Write, remove or list code-signing registry entries");
     sign->add_option("executable", args.sign.executable, "The program to sign or unsign");
     sign->add_option("identifier", args.sign.identifier, "Its signing identifier");
+    sign->add_option("--unit", args.sign.unit,
+                     "Bind a service manager unit (NAME.service) instead of an executable");
     sign->add_option("--entitlements", args.sign.entitlements,
                      "Entitlements as a typed JSON dictionary (default {})");
-    sign->add_flag("--remove", args.signRemove, "Remove the executable's entry");
+    sign->add_flag("--remove", args.signRemove, "Remove the executable's or unit's entry");
     sign->add_flag("--list", args.signList, "List every entry");
 
     CLI::App* lock = app.add_subcommand("lock", "Lock the device (key bag lock state)");

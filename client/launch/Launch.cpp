@@ -17,9 +17,12 @@
 #include <thread>
 
 #include "Sandbox.h"
+#include "platform/CodeSigningRegistry.h"
 #include "platform/DeviceRoot.h"
 #include "platform/LaunchCgroup.h"
+#include "platform/LaunchRecord.h"
 #include "platform/RelaunchBlock.h"
+#include "platform/RootOwnedFiles.h"
 #include "platform/SafeFs.h"
 #include "platform/ServiceCheckIn.h"
 #include "platform/UniqueFd.h"
@@ -75,6 +78,55 @@ bool isSystemProgram(const stdfs::path& program) {
     for (const char* top : {"/usr/", "/etc/", "/bin/", "/sbin/"})
         if (text.rfind(top, 0) == 0) return true;
     return false;
+}
+
+// The program to run, opened once: the file checked against its signature
+// is the file the sandbox runs.
+struct SignedProgram {
+    UniqueFd fd;
+    stdfs::path path;
+    Sha256Digest digest{};
+};
+
+// Opens `path` and requires it to be signed as `identifier` with its present
+// contents, and to be root's alone, so that nobody but root can change it
+// between the check and its end.
+std::optional<SignedProgram> checkSignature(const stdfs::path& path, const std::string& identifier,
+                                            std::ostream& err) {
+    SignedProgram program{fs::openNoFollow(path, O_RDONLY | O_NONBLOCK | O_NOCTTY), path, {}};
+    struct stat status {};
+    if (!program.fd || ::fstat(program.fd.get(), &status) != 0) {
+        fail(err, "cannot open " + path.string() + ": " + std::strerror(errno));
+        return std::nullopt;
+    }
+    if (!S_ISREG(status.st_mode) || !isRootsAlone(status)) {
+        fail(err, path.string() +
+                      " can be changed by users other than root; only a program owned by root and "
+                      "writable by nobody else can be launched");
+        return std::nullopt;
+    }
+    std::string why;
+    const std::optional<Sha256Digest> digest = sha256OfFile(program.fd.get(), &why);
+    if (!digest) {
+        fail(err, "cannot read " + path.string() + ": " + why);
+        return std::nullopt;
+    }
+    program.digest = *digest;
+    const std::optional<SignatureEntry> entry = CodeSigningRegistry().entryFor(path, &why);
+    if (!entry) {
+        fail(err, "cannot launch " + path.string() + " as " + identifier + ": " + why +
+                      " (berthctl sign " + path.string() + " " + identifier + ")");
+        return std::nullopt;
+    }
+    if (entry->identifier != identifier) {
+        fail(err, path.string() + " is signed as " + entry->identifier + ", not " + identifier);
+        return std::nullopt;
+    }
+    if (entry->digest != program.digest) {
+        fail(err, "the contents of " + path.string() + " do not match its signature");
+        return std::nullopt;
+    }
+    return program;
 }
 
 // Asks the daemon for the application's directories.
@@ -138,18 +190,25 @@ bool openContainers(const upcall::Reply& reply, std::vector<UniqueFd>* fds,
     return true;
 }
 
-// In the forked child: into the launch cgroup, the block checked once more
-// (an assertion taken meanwhile killed the group before this process was
-// in it, so it must be caught here), then bubblewrap.
-[[noreturn]] void startSandbox(int groupFd, const std::string& identifier,
+// In the forked child: into the launch's group, the launch recorded (the
+// child is in the group, so a record always names a group that holds its
+// launch until the launch ends), the block checked once more (an assertion
+// taken meanwhile killed the group before this process was in it, so it
+// must be caught here), then bubblewrap.
+[[noreturn]] void startSandbox(const LaunchGroup& launch, const LaunchRecord& record,
                                const std::vector<std::string>& argv,
                                const std::vector<int>& inherited) {
-    if (const int code = LaunchCgroup::join(groupFd)) {
+    if (const int code = LaunchCgroup::join(launch.fd.get())) {
         fail(std::cerr, "cannot join the launch cgroup: " + std::string(std::strerror(code)));
         _exit(kExitLaunchFailed);
     }
-    if (std::optional<std::string> reason = RelaunchBlocks().reasonFor(identifier))
-        _exit(refuseHeld(std::cerr, identifier, *reason));
+    std::string why;
+    if (LaunchRecords().write(launch.name, record, &why) != 0) {
+        fail(std::cerr, "cannot record the launch: " + why);
+        _exit(kExitLaunchFailed);
+    }
+    if (std::optional<std::string> reason = RelaunchBlocks().reasonFor(record.identifier))
+        _exit(refuseHeld(std::cerr, record.identifier, *reason));
     for (int fd : inherited) ::fcntl(fd, F_SETFD, 0);
     std::vector<char*> pointers;
     for (const std::string& arg : argv) pointers.push_back(const_cast<char*>(arg.c_str()));
@@ -159,12 +218,32 @@ bool openContainers(const upcall::Reply& reply, std::vector<UniqueFd>* fds,
     _exit(kExitLaunchFailed);
 }
 
-// Removes the application's group unless another launch of it still runs
-// there. The kernel counts a reaped program in its group a moment longer,
-// so a busy group is tried again for half a second.
-void removeGroup(const LaunchCgroup& cgroups, const std::string& identifier) {
-    for (int attempt = 0; attempt < 50 && cgroups.remove(identifier) == EBUSY; ++attempt)
+// Removes the launch's record and group, and the application's group unless
+// another launch of it still runs there. The kernel counts a reaped program
+// in its group a moment longer, so a busy group is tried again for half a
+// second.
+void removeLaunch(const LaunchCgroup& cgroups, const std::string& identifier,
+                  const std::string& launch) {
+    LaunchRecords().remove(launch);
+    for (int attempt = 0; attempt < 50 && cgroups.removeLaunch(identifier, launch) == EBUSY;
+         ++attempt)
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    cgroups.remove(identifier);
+}
+
+// Removes the records (and groups) of launches that ended without their
+// launcher cleaning up (it was killed): a record whose group is gone, is
+// another group, or holds nothing any more.
+void pruneEndedLaunches(const LaunchCgroup& cgroups) {
+    const LaunchRecords records;
+    for (const std::string& launch : records.launches()) {
+        const std::optional<LaunchRecord> record = records.read(launch);
+        if (record && cgroups.holdsProcesses(record->cgroup, record->cgroupId)) continue;
+        records.remove(launch);
+        if (!record || !record->cgroup.ends_with("/" + launch)) continue;
+        const stdfs::path group = cgroups.mount() / record->cgroup;
+        if (::rmdir(group.c_str()) == 0) ::rmdir(group.parent_path().c_str());
+    }
 }
 
 // What must be there before the daemon is asked.
@@ -172,7 +251,7 @@ struct Prerequisites {
     stdfs::path bwrap;
     LaunchCgroup cgroups;
     UserRecord user;
-    stdfs::path program;
+    SignedProgram program;
 };
 
 std::optional<Prerequisites> checkPrerequisites(const LaunchOptions& options, int* status,
@@ -211,11 +290,13 @@ std::optional<Prerequisites> checkPrerequisites(const LaunchOptions& options, in
                       " in the device's user database");
         return std::nullopt;
     }
-    std::optional<stdfs::path> program = findProgram(options.program.at(0));
-    if (!program) {
+    const std::optional<stdfs::path> found = findProgram(options.program.at(0));
+    if (!found) {
         *status = fail(err, "program not found: " + options.program[0], kExitNotFound);
         return std::nullopt;
     }
+    std::optional<SignedProgram> program = checkSignature(*found, identifier, err);
+    if (!program) return std::nullopt;
     return Prerequisites{*bwrap, std::move(*cgroups), std::move(*user), std::move(*program)};
 }
 
@@ -226,16 +307,25 @@ std::optional<SandboxPlan> planSandbox(const LaunchOptions& options, const Prere
                                        std::ostream& err) {
     SandboxPlan plan;
     if (!openContainers(reply, fds, &plan.bindings, err)) return std::nullopt;
-    if (!isSystemProgram(pre.program)) {
+    const stdfs::path& program = pre.program.path;
+    if (!isSystemProgram(program)) {
         // The program's own directory (its bundle), read-only.
-        UniqueFd directory = fs::openNoFollow(pre.program.parent_path(), O_PATH | O_DIRECTORY);
+        UniqueFd directory = fs::openNoFollow(program.parent_path(), O_PATH | O_DIRECTORY);
         if (!directory) {
             fail(err,
-                 "cannot open " + pre.program.parent_path().string() + ": " + std::strerror(errno));
+                 "cannot open " + program.parent_path().string() + ": " + std::strerror(errno));
             return std::nullopt;
         }
-        plan.bindings.push_back({directory.get(), pre.program.parent_path().string(), false});
+        plan.bindings.push_back({directory.get(), program.parent_path().string(), false});
         fds->push_back(std::move(directory));
+    }
+    plan.programFd = pre.program.fd.get();
+    // The daemon's request socket, where the program looks for it.
+    UniqueFd socket = fs::openNoFollow(
+        ServiceCheckIn::runtimeDirectory() / stdfs::path(kRequestSocketPath).filename(), O_PATH);
+    if (socket) {
+        plan.requestSocketFd = socket.get();
+        fds->push_back(std::move(socket));
     }
     UniqueFd helper(::open("/proc/self/exe", O_PATH | O_CLOEXEC));
     if (!helper) {
@@ -254,7 +344,7 @@ std::optional<SandboxPlan> planSandbox(const LaunchOptions& options, const Prere
     if (reply.tmp) plan.environment.emplace_back("TMPDIR", *reply.tmp);
     plan.workingDirectory = *reply.dataContainer;
     plan.program = options.program;
-    plan.program[0] = pre.program.string();
+    plan.program[0] = program.string();
     return plan;
 }
 
@@ -290,20 +380,27 @@ int runLaunch(const LaunchOptions& options, std::ostream& err) {
 
     std::vector<std::string> argv = {pre->bwrap.string()};
     for (std::string& arg : bubblewrapArguments(*plan)) argv.push_back(std::move(arg));
-    std::vector<int> inherited;
+    std::vector<int> inherited = {pre->program.fd.get()};
     for (const UniqueFd& fd : fds) inherited.push_back(fd.get());
 
-    UniqueFd group = pre->cgroups.create(identifier);
-    if (!group)
-        return fail(err, "cannot create the launch cgroup " +
+    pruneEndedLaunches(pre->cgroups);
+    const std::optional<LaunchGroup> launch = pre->cgroups.createLaunch(identifier);
+    if (!launch)
+        return fail(err, "cannot create a launch cgroup under " +
                              pre->cgroups.pathOf(identifier).string() + ": " +
                              std::strerror(errno));
+    const LaunchRecord record{identifier,    pre->program.path, pre->program.digest,
+                              pre->user.uid, launch->path,      launch->id};
     const pid_t pid = ::fork();
-    if (pid < 0) return fail(err, "fork: " + std::string(std::strerror(errno)));
-    if (pid == 0) startSandbox(group.get(), identifier, argv, inherited);
+    if (pid < 0) {
+        const int error = errno;
+        removeLaunch(pre->cgroups, identifier, launch->name);
+        return fail(err, "fork: " + std::string(std::strerror(error)));
+    }
+    if (pid == 0) startSandbox(*launch, record, argv, inherited);
     while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
     }
-    removeGroup(pre->cgroups, identifier);
+    removeLaunch(pre->cgroups, identifier, launch->name);
     if (WIFSIGNALED(status)) {
         err << "berth-launch: " << identifier << " ended by signal " << WTERMSIG(status) << "\n";
         return 128 + WTERMSIG(status);

@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <set>
 
 namespace berth::launch {
@@ -54,6 +55,13 @@ std::vector<std::string> bubblewrapArguments(const SandboxPlan& plan) {
         }
         args.insert(args.end(), {binding.writable ? "--bind-fd" : "--ro-bind-fd",
                                  std::to_string(binding.fd), binding.destination});
+    }
+    if (plan.programFd >= 0 && !plan.program.empty())
+        args.insert(args.end(), {"--ro-bind-fd", std::to_string(plan.programFd), plan.program[0]});
+    if (plan.requestSocketFd >= 0) {
+        const std::string directory = std::filesystem::path(kRequestSocketPath).parent_path();
+        args.insert(args.end(), {"--perms", "0755", "--dir", directory, "--bind-fd",
+                                 std::to_string(plan.requestSocketFd), kRequestSocketPath});
     }
     args.insert(args.end(), {"--ro-bind-fd", std::to_string(plan.helperFd), kHelperPath});
     for (const auto& [name, value] : plan.environment)

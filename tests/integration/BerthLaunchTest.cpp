@@ -1,6 +1,7 @@
 // berth-launch against a real daemon (root, bubblewrap, cgroup v2): what the
-// launched program can and cannot see and touch, whose user it runs as, a
-// termination assertion that kills it and refuses its relaunch until
+// launched program can and cannot see and touch, whose user it runs as, who
+// the daemon takes it and its children for, the programs it refuses to run,
+// a termination assertion that kills it and refuses its relaunch until
 // invalidated, and the errors that name a missing prerequisite.
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -9,11 +10,14 @@
 #include <sys/wait.h>
 
 #include <cstdlib>
+#include <fstream>
 
 #include "BTHApplicationTerminationAssertion.h"
 #include "CgroupSupport.h"
 #include "DaemonSupport.h"
+#include "platform/CodeSigningRegistry.h"
 #include "platform/LaunchCgroup.h"
+#include "platform/LaunchRecord.h"
 #include "platform/RelaunchBlock.h"
 #include "upcall/BerthUpcall.h"
 
@@ -25,6 +29,7 @@ using namespace std::chrono_literals;
 using test::deviceRoot;
 
 const fs::path kLauncher = BERTH_LAUNCH_BINARY_PATH;
+const fs::path kClient = BERTH_IDENTITY_CLIENT_PATH;
 const std::string kCgroupParent = "berth-test.launch." + std::to_string(::getpid());
 
 // A launcher started in the background, its output collected in files.
@@ -95,21 +100,15 @@ class BerthLaunchTest : public test::DaemonFixture {
         // The launcher, the daemon and this program's termination service
         // share a scratch parent group.
         ::setenv("BERTH_LAUNCH_CGROUP", kCgroupParent.c_str(), 1);
-        // The persona walks down to its containers through the root.
+        // The persona walks down to its containers through the root, and to
+        // the programs' bundles.
         fs::permissions(deviceRoot(), fs::perms(0755));
+        fs::permissions(bundles_.path(), fs::perms(0755));
         ASSERT_NO_FATAL_FAILURE(start({{"BERTH_LAUNCH_CGROUP", kCgroupParent}}));
     }
 
     void TearDown() override {
-        if (cgroups_) {
-            std::error_code ignored;
-            for (const auto& entry : fs::directory_iterator(cgroups_->parentPath(), ignored)) {
-                if (!entry.is_directory()) continue;
-                cgroups_->killAll(entry.path().filename(), 10s);
-                ::rmdir(entry.path().c_str());
-            }
-            ::rmdir(cgroups_->parentPath().c_str());
-        }
+        if (cgroups_) test::removeCgroupTree(cgroups_->parentPath());
         DaemonFixture::TearDown();
     }
 
@@ -127,15 +126,35 @@ class BerthLaunchTest : public test::DaemonFixture {
         return answer ? answer->reply : upcall::Reply{};
     }
 
-    static std::vector<std::string> launchArgs(const std::string& identifier,
-                                               const std::string& script,
-                                               std::vector<std::string> extra = {}) {
+    // A copy of `program` in the bundle directory of `identifier`, owned by
+    // root, signed as `identifier` with `entitlements` unless `sign` is false.
+    fs::path bundled(const std::string& identifier, const fs::path& program,
+                     const std::string& name, bool sign = true,
+                     const Value& entitlements = Value::dictionary()) {
+        const fs::path bundle = bundles_ / identifier;
+        fs::create_directories(bundle);
+        fs::permissions(bundle, fs::perms(0755));
+        fs::copy_file(fs::canonical(program), bundle / name, fs::copy_options::overwrite_existing);
+        fs::permissions(bundle / name, fs::perms(0755));
+        std::string why;
+        if (sign) {
+            EXPECT_EQ(CodeSigningRegistry().sign(bundle / name, identifier, entitlements, &why), 0)
+                << why;
+        }
+        return bundle / name;
+    }
+
+    // The arguments that launch `script` in a shell signed as `identifier`.
+    std::vector<std::string> launchArgs(const std::string& identifier, const std::string& script,
+                                        std::vector<std::string> extra = {}) {
         std::vector<std::string> args = {"--identifier", identifier, "--persona", "501"};
         args.insert(args.end(), extra.begin(), extra.end());
-        args.insert(args.end(), {"--", "/bin/sh", "-c", script, "sh"});
+        args.insert(args.end(),
+                    {"--", bundled(identifier, "/bin/sh", "sh").string(), "-c", script, "sh"});
         return args;
     }
 
+    test::ScratchDir bundles_;
     std::optional<LaunchCgroup> cgroups_;
 };
 
@@ -186,10 +205,10 @@ TEST_F(BerthLaunchTest, TheProgramSeesOnlyItsContainersAsThePersona) {
 }
 
 TEST_F(BerthLaunchTest, EvenARootPersonaRunsWithoutCapabilities) {
-    const test::Outcome outcome =
-        Launch({"--identifier", "com.example.rooted", "--persona", "0", "--", "/bin/sh", "-c",
-                "id -u; grep -E '^Cap(Eff|Prm|Bnd)' /proc/self/status"})
-            .wait();
+    std::vector<std::string> args =
+        launchArgs("com.example.rooted", "id -u; grep -E '^Cap(Eff|Prm|Bnd)' /proc/self/status");
+    args[3] = "0";  // the persona
+    const test::Outcome outcome = Launch(args).wait();
     ASSERT_EQ(outcome.status, 0) << outcome.err;
     EXPECT_EQ(outcome.out,
               "0\nCapPrm:\t0000000000000000\nCapEff:\t0000000000000000\n"
@@ -253,9 +272,7 @@ TEST_F(BerthLaunchTest, ADaemonStartLiftsTheBlocksOfItsPredecessor) {
                                       .wait();
     EXPECT_EQ(refused.status, 125) << refused.err;
     ASSERT_NO_FATAL_FAILURE(start({{"BERTH_LAUNCH_CGROUP", kCgroupParent}}));
-    const test::Outcome launched = Launch({"--identifier", "com.example.orphaned", "--persona",
-                                           "501", "--", "/bin/echo", "ran"})
-                                       .wait();
+    const test::Outcome launched = Launch(launchArgs("com.example.orphaned", "echo ran")).wait();
     EXPECT_EQ(launched.status, 0) << launched.err;
     EXPECT_EQ(launched.out, "ran\n");
 }
@@ -298,6 +315,73 @@ TEST_F(BerthLaunchTest, AMissingPrerequisiteIsNamed) {
     EXPECT_EQ(noDaemon.status, 125);
     EXPECT_NE(noDaemon.err.find("berthd is not running on the device root"), std::string::npos)
         << noDaemon.err;
+}
+
+TEST_F(BerthLaunchTest, TheAppAndWhatItForksAndExecsAreWhoItWasLaunchedAs) {
+    const std::string identifier = "com.example.identity";
+    const fs::path app = bundled(identifier, kClient, "app", true,
+                                 test::dict({{"sys.kelp.private.Berth.allowed", true}}));
+    const fs::path helper = bundled(identifier, kClient, "helper", false);
+    // The app asks through the socket the sandbox gives it, forks, and its
+    // child execs an unsigned program of the bundle that connects on its own.
+    const test::Outcome outcome =
+        Launch({"--identifier", identifier, "--persona", "501", "--", app.string(), "ask", "who",
+                "fork", "exec", helper.string(), "connect", "/run/berthd/sys.kelp.berthd", "ask",
+                "who"})
+            .wait();
+    ASSERT_EQ(outcome.status, 0) << outcome.err << outcome.out;
+    EXPECT_EQ(outcome.out,
+              "served\nidentifier " + identifier + "\nserved\nidentifier " + identifier + "\n");
+    // The launch leaves no record and no group behind.
+    EXPECT_TRUE(LaunchRecords().launches().empty());
+    EXPECT_FALSE(fs::exists(cgroups_->pathOf(identifier)));
+
+    // The same program started by the user directly is nobody.
+    const fs::path socket = deviceRoot() / "run/berthd/sys.kelp.berthd";
+    EXPECT_EQ(test::run(app, {"connect", socket.string(), "ask"}, 501).out, "refused\n");
+}
+
+TEST_F(BerthLaunchTest, OnlyAProgramSignedAsTheApplicationAndRootsAloneIsLaunched) {
+    const fs::path unsignedProgram = bundled("com.example.plain", "/bin/true", "true", false);
+    const fs::path other = bundled("com.example.other", "/bin/true", "true");
+    const fs::path changed = bundled("com.example.changed", "/bin/true", "true");
+    std::ofstream(changed, std::ios::app) << "\n";
+    const fs::path writable = bundled("com.example.writable", "/bin/true", "true");
+    fs::permissions(writable, fs::perms(0775));
+    struct Case {
+        std::string identifier;
+        fs::path program;
+        std::string why;
+    };
+    for (const Case& c :
+         {Case{"com.example.plain", unsignedProgram,
+               "no signature for " + unsignedProgram.string()},
+          Case{"com.example.impostor", other,
+               "is signed as com.example.other, not com.example.impostor"},
+          Case{"com.example.changed", changed, "do not match its signature"},
+          Case{"com.example.writable", writable, "can be changed by users other than root"}}) {
+        SCOPED_TRACE(c.identifier);
+        const test::Outcome refused =
+            Launch({"--identifier", c.identifier, "--persona", "501", "--", c.program.string()})
+                .wait();
+        EXPECT_EQ(refused.status, 125);
+        EXPECT_NE(refused.err.find(c.why), std::string::npos) << refused.err;
+    }
+    EXPECT_TRUE(LaunchRecords().launches().empty());
+}
+
+TEST_F(BerthLaunchTest, ALaunchWhoseLauncherDiedLeavesNoUsableRecord) {
+    // A launcher killed with its program leaves a record and an empty group;
+    // the next launch clears them.
+    std::optional<LaunchGroup> group = cgroups_->createLaunch("com.example.orphan");
+    ASSERT_TRUE(group);
+    const fs::path program = bundled("com.example.orphan", "/bin/true", "true");
+    ASSERT_EQ(LaunchRecords().write(
+                  group->name, {"com.example.orphan", program, {}, 501, group->path, group->id}),
+              0);
+    EXPECT_EQ(Launch(launchArgs("com.example.next", "echo ran")).wait().out, "ran\n");
+    EXPECT_TRUE(LaunchRecords().launches().empty());
+    EXPECT_FALSE(fs::exists(cgroups_->mount() / group->path));
 }
 
 }  // namespace

@@ -90,6 +90,15 @@ TEST_F(BerthctlTest, EntitlementsFollowTheSignatureOfTheRunningProgram) {
     EXPECT_NE(printedReplyError(admitted), 55u) << admitted.err;
     EXPECT_NE(admitted.status, 2) << admitted.err;
 
+    // The same signed program run by another user than root is nobody: what
+    // such a process runs says nothing about who speaks.
+    for (std::filesystem::path dir = daemon_->requestSocket().parent_path();
+         dir != root().parent_path(); dir = dir.parent_path())
+        std::filesystem::permissions(dir, std::filesystem::perms::others_exec,
+                                     std::filesystem::perm_options::add);
+    const Outcome asUser = berthctl({"send", R"({"Command": 1})"}, 501);
+    EXPECT_EQ(printedReplyError(asUser), 55u) << asUser.err;
+
     // Without its entry the same program is a stranger again.
     const Outcome removed = berthctl({"sign", "--remove", kBerthctl.string()});
     ASSERT_EQ(removed.status, 0) << removed.err;
@@ -193,6 +202,36 @@ TEST_F(BerthctlTest, OnlyRootChangesTheSigningRegistry) {
     EXPECT_EQ(berthctl({"sign", "--remove", kBerthctl.string()}, kNobody).status, 1);
     EXPECT_TRUE(CodeSigningRegistry().entryFor(canonical));
     ASSERT_EQ(berthctl({"sign", "--remove", kBerthctl.string()}).status, 0);
+}
+
+TEST_F(BerthctlTest, SignBindsAUnitByName) {
+    const Outcome signedUnit =
+        berthctl({"sign", "--unit", "lanternd.service", "sys.kelp.lanternd", "--entitlements",
+                  R"({"sys.kelp.private.Berth.allowed": true})"});
+    ASSERT_EQ(signedUnit.status, 0) << signedUnit.err;
+    EXPECT_EQ(signedUnit.out,
+              "signed unit lanternd.service\n"
+              "    identifier    sys.kelp.lanternd\n"
+              "    entitlements  {\"sys.kelp.private.Berth.allowed\":true}\n");
+    const auto entry = CodeSigningRegistry().entryForUnit("lanternd.service");
+    ASSERT_TRUE(entry);
+    EXPECT_EQ(entry->identifier, "sys.kelp.lanternd");
+
+    const Outcome listed = berthctl({"--json", "sign", "--list"});
+    EXPECT_NE(listed.out.find(R"("unit":"lanternd.service")"), std::string::npos) << listed.out;
+
+    EXPECT_EQ(berthctl({"sign", "--unit", "lanternd.slice", "sys.kelp.x"}).status, 1);
+    EXPECT_EQ(berthctl({"sign", "--unit", "lanternd.service"}).status, 64);
+    EXPECT_EQ(berthctl({"sign", "--unit", "a.service", "/bin/true", "sys.kelp.x"}).status, 64);
+    EXPECT_EQ(berthctl({"sign", "--list", "--unit", "a.service"}).status, 64);
+    EXPECT_EQ(berthctl({"sign", "--unit", "a.service", "sys.kelp.x"}, kNobody).status, 1);
+    EXPECT_FALSE(CodeSigningRegistry().entryForUnit("a.service"));
+
+    EXPECT_EQ(berthctl({"sign", "--remove", "--unit", "lanternd.service"}, kNobody).status, 1);
+    const Outcome removed = berthctl({"sign", "--remove", "--unit", "lanternd.service"});
+    EXPECT_EQ(removed.status, 0) << removed.err;
+    EXPECT_EQ(removed.out, "removed the signature of the unit lanternd.service\n");
+    EXPECT_FALSE(CodeSigningRegistry().entryForUnit("lanternd.service"));
 }
 
 TEST_F(BerthctlTest, CommandsListsEveryCommandWithItsEntitlement) {

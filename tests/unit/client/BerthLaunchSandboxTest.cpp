@@ -70,5 +70,35 @@ TEST(BerthLaunchSandboxTest, ContainersAreBoundFromTheirDescriptorsBelowReachabl
     EXPECT_TRUE(std::equal(tail.begin(), tail.end(), args.end() - tail.size()));
 }
 
+TEST(BerthLaunchSandboxTest, TheCheckedProgramAndTheRequestSocketAreBoundFromDescriptors) {
+    SandboxPlan plan;
+    plan.bindings = {{9, "/opt/app/bin", false}};
+    plan.helperFd = 10;
+    plan.programFd = 11;
+    plan.requestSocketFd = 12;
+    plan.program = {"/opt/app/bin/app"};
+    const std::vector<std::string> args = bubblewrapArguments(plan);
+    // The program's own file comes after its directory, so it is the file
+    // whose signature was checked that runs, read-only.
+    const std::vector<size_t> directory = positionsOf(args, {"--ro-bind-fd", "9", "/opt/app/bin"});
+    const std::vector<size_t> program =
+        positionsOf(args, {"--ro-bind-fd", "11", "/opt/app/bin/app"});
+    ASSERT_EQ(directory.size(), 1u);
+    ASSERT_EQ(program.size(), 1u);
+    EXPECT_LT(directory[0], program[0]);
+    EXPECT_EQ(positionsOf(args, {"--perms", "0755", "--dir", "/run/berthd", "--bind-fd", "12",
+                                 kRequestSocketPath})
+                  .size(),
+              1u);
+    EXPECT_LT(positionsOf(args, {"--dir", "/run"})[0],
+              positionsOf(args, {"--dir", "/run/berthd"})[0]);
+
+    // Without them, nothing is bound in their place.
+    plan.programFd = plan.requestSocketFd = -1;
+    const std::vector<std::string> bare = bubblewrapArguments(plan);
+    EXPECT_TRUE(positionsOf(bare, {"/opt/app/bin/app"}).size() == 1u);  // the command only
+    EXPECT_TRUE(positionsOf(bare, {kRequestSocketPath}).empty());
+}
+
 }  // namespace
 }  // namespace berth::launch

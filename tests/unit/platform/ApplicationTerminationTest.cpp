@@ -72,23 +72,18 @@ class CgroupTerminationTest : public ::testing::TestWithParam<bool> {
         }
         // Forks of the children too: anything left would hold the test's
         // output open.
-        std::error_code ignored;
-        for (const auto& entry : fs::directory_iterator(cgroups_->parentPath(), ignored)) {
-            if (!entry.is_directory()) continue;
-            cgroups_->killAll(entry.path().filename(), 10s);
-            ::rmdir(entry.path().c_str());
-        }
-        ::rmdir(cgroups_->parentPath().c_str());
+        test::removeCgroupTree(cgroups_->parentPath());
     }
 
-    // A process in the identifier's group that forks a grandchild, both
-    // sleeping until killed.
+    // A process in a launch group of the identifier that forks a grandchild,
+    // both sleeping until killed.
     pid_t startInGroup(const std::string& identifier) {
-        UniqueFd group = cgroups_->create(identifier);
-        EXPECT_TRUE(group) << strerror(errno);
+        std::optional<LaunchGroup> launch = cgroups_->createLaunch(identifier);
+        EXPECT_TRUE(launch) << strerror(errno);
+        const int group = launch ? launch->fd.get() : -1;
         const pid_t pid = ::fork();
         if (pid == 0) {
-            if (LaunchCgroup::join(group.get()) != 0) _exit(1);
+            if (LaunchCgroup::join(group) != 0) _exit(1);
             if (::fork() == 0) ::pause();
             ::pause();
             _exit(0);

@@ -274,6 +274,61 @@ TEST_F(CodeSigningRegistryTest, SignIsRootOnlyAndRefusesBadInput) {
     EXPECT_NE(why.find("not root's alone"), std::string::npos) << why;
 }
 
+TEST_F(CodeSigningRegistryTest, UnitsAreSignedByNameBesideExecutables) {
+    signSleeper();
+    SignatureEntry written;
+    std::string why;
+    ASSERT_EQ(registry_.signUnit("lanternd.service", "sys.kelp.lanternd", sampleEntitlements(),
+                                 &why, &written),
+              0)
+        << why;
+    EXPECT_TRUE(written.isUnit());
+    EXPECT_EQ(written.key(), "lanternd.service");
+    EXPECT_EQ(lstatOf(registry_.directory() /
+                      CodeSigningRegistry::entryFileName(std::string("lanternd.service")))
+                      .st_mode &
+                  07777,
+              0644u);
+    EXPECT_EQ(registry_.entryForUnit("lanternd.service", &why), written) << why;
+    // A unit is no executable, and an executable no unit.
+    EXPECT_FALSE(registry_.entryFor("lanternd.service"));
+    EXPECT_FALSE(registry_.entryForUnit("other.service", &why));
+    EXPECT_NE(why.find("no signature for other.service"), std::string::npos) << why;
+
+    CodeSigningRegistry::Listing listing = registry_.list();
+    ASSERT_EQ(listing.entries.size(), 2u);
+    EXPECT_EQ(listing.entries[0].executablePath, fs::canonical(sleeper_));
+    EXPECT_EQ(listing.entries[1], written);
+
+    // The entry of one unit under another's name is not the other's.
+    ASSERT_EQ(registry_.signUnit("other.service", "sys.kelp.other", Value::dictionary()), 0);
+    const fs::path otherFile =
+        registry_.directory() / CodeSigningRegistry::entryFileName(std::string("other.service"));
+    fs::copy_file(
+        registry_.directory() / CodeSigningRegistry::entryFileName(std::string("lanternd.service")),
+        otherFile, fs::copy_options::overwrite_existing);
+    EXPECT_FALSE(registry_.entryForUnit("other.service", &why));
+    EXPECT_NE(why.find("names another unit (lanternd.service)"), std::string::npos) << why;
+
+    for (const char* bad : {"", "lanternd", "a.slice", "a/b.service", "../x.service"})
+        EXPECT_EQ(registry_.signUnit(bad, "x", Value::dictionary()), EINVAL) << bad;
+    EXPECT_EQ(registry_.signUnit("a.service", "", Value::dictionary()), EINVAL);
+    EXPECT_EQ(registry_.signUnit("a.service", "x", Value::array()), EINVAL);
+    EXPECT_EQ(inChild([] {
+                  if (::seteuid(65534) != 0) return 2;
+                  CodeSigningRegistry registry;
+                  return registry.signUnit("a.service", "x", Value::dictionary()) == EPERM &&
+                                 registry.removeUnit("lanternd.service") == EPERM
+                             ? 0
+                             : 1;
+              }),
+              0);
+
+    EXPECT_EQ(registry_.removeUnit("lanternd.service", &why), 0) << why;
+    EXPECT_EQ(registry_.removeUnit("lanternd.service", &why), ENOENT);
+    EXPECT_FALSE(registry_.entryForUnit("lanternd.service"));
+}
+
 TEST_F(CodeSigningRegistryTest, OnlyTheLiveProcessOfThePidfdIsIdentified) {
     signSleeper();
     std::string why;

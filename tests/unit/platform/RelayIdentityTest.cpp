@@ -1,8 +1,10 @@
 // Who the relay says a peer is, against real processes: copies of this test
-// program act as clients (signed in the scratch root's registry or not) and
+// program act as clients (signed in the scratch root's registry or not, run
+// by root or by another user, in launch groups and units or not) and
 // connect, exec, fork and exit while the server asks for their identity on
 // every request.
 #include <fcntl.h>
+#include <grp.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -12,6 +14,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "CgroupSupport.h"
 #include "RelayTestServer.h"
 #include "ScratchDeviceRoot.h"
 #include "platform/CodeSigningRegistry.h"
@@ -88,16 +91,28 @@ void answer(const std::string& line) {
 
 // ---------------------------------------------------------------------------
 
+const std::string kLaunchParent = "berth-test.identity." + std::to_string(::getpid());
+
+// How a client is started: as which user, in which control group.
+struct Start {
+    std::optional<uid_t> user = {};
+    int groupFd = -1;
+};
+
 // A client process started from `executable` in the client role, driven
 // through pipes. Killed and reaped when the object goes, if still running.
 class ClientProcess {
   public:
     ClientProcess(const std::filesystem::path& executable, const std::filesystem::path& socket,
-                  const std::filesystem::path& execTarget = {}) {
+                  const std::filesystem::path& execTarget = {}, Start start = {}) {
         int toChild[2], fromChild[2];
         if (::pipe2(toChild, O_CLOEXEC) != 0 || ::pipe2(fromChild, O_CLOEXEC) != 0) return;
         pid_ = ::fork();
         if (pid_ == 0) {
+            if (start.groupFd >= 0 && LaunchCgroup::join(start.groupFd) != 0) _exit(125);
+            if (start.user && (::setgroups(0, nullptr) != 0 || ::setgid(*start.user) != 0 ||
+                               ::setuid(*start.user) != 0))
+                _exit(126);
             ::dup2(toChild[0], STDIN_FILENO);
             ::dup2(fromChild[1], STDOUT_FILENO);
             ::setenv("BERTH_RELAY_ROLE", "client", 1);
@@ -195,7 +210,8 @@ class RelayIdentityTest : public ::testing::Test {
     test::ScratchDir bin_;
     std::filesystem::path unsigned_;
     std::filesystem::path signed_;
-    std::shared_ptr<CodeSigningRegistry> registry_ = std::make_shared<CodeSigningRegistry>();
+    std::shared_ptr<CodeSigningRegistry> registry_ = std::make_shared<CodeSigningRegistry>(
+        CodeSigningRegistry::Options{.directory = {}, .launchCgroupParent = kLaunchParent});
     std::unique_ptr<RelayTestServer> server_;
     std::mutex mutex_;
     std::map<uint64_t, RelayPeerIdentity> seen_;
@@ -248,6 +264,203 @@ TEST_F(RelayIdentityTest, ASocketOutlivingTheProcessThatConnectedCarriesNoIdenti
     client.reap();
     ASSERT_EQ(client.command("send 2"), "ok");
     expectUnbound(seen(2), client.pid(), "exited");
+}
+
+// ---------------------------------------------------------------------------
+// Peers of another user than root: who they were started as.
+
+constexpr uid_t kAppUser = 501;
+
+class StartedIdentityTest : public RelayIdentityTest {
+  protected:
+    void SetUp() override {
+        RelayIdentityTest::SetUp();
+        if (IsSkipped() || HasFatalFailure()) return;
+        std::string why;
+        cgroups_ = LaunchCgroup::locate(kLaunchParent, &why);
+        if (!cgroups_) GTEST_SKIP() << why;
+        if (const std::string unusable = test::launchCgroupsUnusable(*cgroups_);
+            !unusable.empty()) {
+            cgroups_.reset();
+            GTEST_SKIP() << unusable;
+        }
+        // The app user reaches the programs and the socket.
+        std::filesystem::permissions(bin_.path(), std::filesystem::perms(0755));
+        std::filesystem::permissions(server_->path().parent_path(), std::filesystem::perms(0755));
+    }
+
+    void TearDown() override {
+        if (cgroups_) test::removeCgroupTree(cgroups_->parentPath());
+        for (const std::filesystem::path& group : extraGroups_) test::removeCgroupTree(group);
+    }
+
+    // A client of the app user in the group open at `groupFd`, connected.
+    std::unique_ptr<ClientProcess> startClient(const std::filesystem::path& program, int groupFd,
+                                               const std::filesystem::path& execTarget = {}) {
+        auto client = std::make_unique<ClientProcess>(program, server_->path(), execTarget,
+                                                      Start{kAppUser, groupFd});
+        EXPECT_EQ(client->readLine(), "connected");
+        return client;
+    }
+
+    // What the server saw of request `tag`, sent now by `client`.
+    RelayPeerIdentity identityOf(ClientProcess& client, uint64_t tag) {
+        EXPECT_EQ(client.command("send " + std::to_string(tag)), "ok");
+        return seen(tag);
+    }
+
+    std::optional<LaunchCgroup> cgroups_;
+    std::vector<std::filesystem::path> extraGroups_;
+};
+
+// The peer is alive and served, but as nobody, for the reason `why`.
+void expectNobody(const RelayPeerIdentity& identity, const std::string& why) {
+    EXPECT_TRUE(identity.processStillBound) << identity.signingError;
+    EXPECT_EQ(identity.effectiveUserId, kAppUser);
+    EXPECT_FALSE(identity.signingIdentifier);
+    EXPECT_FALSE(identity.entitlements);
+    EXPECT_NE(identity.signingError.find(why), std::string::npos) << identity.signingError;
+}
+
+TEST_F(StartedIdentityTest, ASignedProgramOfAnotherUserIsNobodyOutsideALaunch) {
+    auto client = startClient(signed_, -1);
+    expectNobody(identityOf(*client, 1), "neither launched by berth-launch nor");
+}
+
+TEST_F(StartedIdentityTest, ALaunchedProcessKeepsItsIdentityWhateverItExecsUntilItExits) {
+    std::optional<test::RecordedLaunch> launch =
+        test::recordLaunch(*cgroups_, "sys.kelp.test.client", signed_, kAppUser);
+    ASSERT_TRUE(launch) << strerror(errno);
+    auto client = startClient(signed_, launch->group.fd.get(), unsigned_);
+    const RelayPeerIdentity first = identityOf(*client, 1);
+    EXPECT_TRUE(first.processStillBound) << first.signingError;
+    EXPECT_EQ(first.effectiveUserId, kAppUser);
+    EXPECT_EQ(first.signingIdentifier, "sys.kelp.test.client");
+    EXPECT_EQ(first.entitlements, entitlementsAllowing("sys.kelp.private.Berth.allowed"));
+
+    // An app's children are the app, whatever program they run.
+    ASSERT_EQ(client->command("exec"), "connected");
+    EXPECT_EQ(identityOf(*client, 2).signingIdentifier, "sys.kelp.test.client");
+
+    // Re-signing with other entitlements applies to the next request.
+    sign(entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
+    EXPECT_EQ(identityOf(*client, 3).entitlements,
+              entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
+
+    // A socket passed on by a process that exited speaks for nobody.
+    const std::string forked = client->command("fork-exit");
+    ASSERT_EQ(forked.rfind("forked ", 0), 0u) << forked;
+    client->reap();
+    expectUnbound(identityOf(*client, 4), client->pid(), "exited");
+}
+
+// Each check a launch must pass, broken one at a time on a live connection
+// (identity is evaluated per request) and then repaired.
+TEST_F(StartedIdentityTest, ALaunchCountsOnlyWithItsOwnRecordInGroupsOnlyRootCanFill) {
+    std::optional<test::RecordedLaunch> launch =
+        test::recordLaunch(*cgroups_, "sys.kelp.test.client", signed_, kAppUser);
+    ASSERT_TRUE(launch) << strerror(errno);
+    auto client = startClient(signed_, launch->group.fd.get());
+    uint64_t tag = 1;
+    ASSERT_EQ(identityOf(*client, tag++).signingIdentifier, "sys.kelp.test.client");
+
+    const LaunchRecords records;
+    const std::filesystem::path recordFile = records.directory() / (launch->group.name + ".plist");
+    const std::filesystem::path launchGroup = cgroups_->mount() / launch->group.path;
+    const std::filesystem::path identifierGroup = launchGroup.parent_path();
+    auto rewrite = [&](const std::function<void(LaunchRecord&)>& change) {
+        LaunchRecord record = launch->record;
+        change(record);
+        ASSERT_EQ(records.write(launch->group.name, record), 0);
+    };
+    auto restore = [&] { rewrite([](LaunchRecord&) {}); };
+    struct Case {
+        const char* what;
+        std::function<void()> breakIt;
+        std::function<void()> repair;
+        const char* why;
+    };
+    const std::vector<Case> cases = {
+        {"a record of an earlier group of the same name",
+         [&] { rewrite([](LaunchRecord& r) { r.cgroupId += 1; }); }, restore,
+         "made for another group"},
+        {"a record of another identifier",
+         [&] { rewrite([](LaunchRecord& r) { r.identifier = "sys.kelp.test.other"; }); }, restore,
+         "made for another group"},
+        {"a record for another user",
+         [&] { rewrite([](LaunchRecord& r) { r.persona = kAppUser + 1; }); }, restore,
+         "runs as uid 502, not 501"},
+        {"a program changed since it was launched",
+         [&] { rewrite([](LaunchRecord& r) { r.digest[0] ^= 1; }); }, restore,
+         "no longer signed as it was launched"},
+        {"no record", [&] { ASSERT_EQ(records.remove(launch->group.name), 0); }, restore,
+         "no launch record"},
+        {"a record the user could have written",
+         [&] { ASSERT_EQ(::chown(recordFile.c_str(), kAppUser, kAppUser), 0); },
+         [&] { ASSERT_EQ(::chown(recordFile.c_str(), 0, 0), 0); }, "is not root's alone"},
+        {"a launch group the user can move processes into",
+         [&] { ASSERT_EQ(::chown((launchGroup / "cgroup.procs").c_str(), kAppUser, 0), 0); },
+         [&] { ASSERT_EQ(::chown((launchGroup / "cgroup.procs").c_str(), 0, 0), 0); },
+         "can be moved into"},
+        {"an identifier group others can write",
+         [&] { ASSERT_EQ(::chmod(identifierGroup.c_str(), 0777), 0); },
+         [&] { ASSERT_EQ(::chmod(identifierGroup.c_str(), 0755), 0); }, "is not root's alone"},
+        {"the program signed as another identifier since",
+         [&] {
+             ASSERT_EQ(registry_->sign(signed_, "sys.kelp.test.renamed",
+                                       entitlementsAllowing("sys.kelp.private.Berth.allowed")),
+                       0);
+         },
+         [&] { sign(entitlementsAllowing("sys.kelp.private.Berth.allowed")); },
+         "no longer signed as it was launched"},
+        {"the program's signature withdrawn", [&] { ASSERT_EQ(registry_->remove(signed_), 0); },
+         [&] { sign(entitlementsAllowing("sys.kelp.private.Berth.allowed")); }, "no signature for"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.what);
+        c.breakIt();
+        expectNobody(identityOf(*client, tag++), c.why);
+        c.repair();
+        EXPECT_EQ(identityOf(*client, tag++).signingIdentifier, "sys.kelp.test.client");
+    }
+}
+
+TEST_F(StartedIdentityTest, TheProcessesOfABoundUnitAreItsEntry) {
+    const std::string name = "berth-test-" + std::to_string(::getpid());
+    const std::string unit = name + ".service";
+    const std::filesystem::path slice = cgroups_->mount() / (name + ".slice");
+    const std::filesystem::path worker = slice / unit / "worker";
+    extraGroups_.push_back(slice);
+    std::filesystem::create_directories(worker);
+    std::string why;
+    ASSERT_EQ(registry_->signUnit(unit, "sys.kelp.test.service",
+                                  entitlementsAllowing("sys.kelp.private.Berth.allowed"), &why),
+              0)
+        << why;
+    // A group of the unit's own below it, as a service that manages its
+    // groups makes: still the unit.
+    UniqueFd group(::open(worker.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    ASSERT_TRUE(group);
+    auto client = startClient(signed_, group.get());
+    uint64_t tag = 1;
+    RelayPeerIdentity identity = identityOf(*client, tag++);
+    EXPECT_EQ(identity.signingIdentifier, "sys.kelp.test.service") << identity.signingError;
+    EXPECT_EQ(identity.entitlements, entitlementsAllowing("sys.kelp.private.Berth.allowed"));
+
+    // A unit delegated to its own user may rearrange its own processes;
+    // nobody outside can move one in, so it stays the unit.
+    ASSERT_EQ(::chown((slice / unit).c_str(), kAppUser, kAppUser), 0);
+    ASSERT_EQ(::chown((slice / unit / "cgroup.procs").c_str(), kAppUser, kAppUser), 0);
+    EXPECT_EQ(identityOf(*client, tag++).signingIdentifier, "sys.kelp.test.service");
+
+    // A slice above it that the user could fill is not.
+    ASSERT_EQ(::chown((slice / "cgroup.procs").c_str(), kAppUser, kAppUser), 0);
+    expectNobody(identityOf(*client, tag++), "can be moved into");
+    ASSERT_EQ(::chown((slice / "cgroup.procs").c_str(), 0, 0), 0);
+    EXPECT_EQ(identityOf(*client, tag++).signingIdentifier, "sys.kelp.test.service");
+
+    ASSERT_EQ(registry_->removeUnit(unit, &why), 0) << why;
+    expectNobody(identityOf(*client, tag++), "no signature for " + unit);
 }
 
 }  // namespace
