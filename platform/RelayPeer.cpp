@@ -88,11 +88,16 @@ RelayPeerIdentity RelayPeer::identity() const {
     return uid_ == 0 ? executableIdentity() : launchedIdentity();
 }
 
-RelayPeerIdentity RelayPeer::launchedIdentity() const {
+RelayPeerIdentity RelayPeer::credentials() const {
     RelayPeerIdentity identity;
     identity.pid = pid_;
     identity.effectiveUserId = uid_;
     identity.groupId = gid_;
+    return identity;
+}
+
+RelayPeerIdentity RelayPeer::launchedIdentity() const {
+    RelayPeerIdentity identity = credentials();
     if (!pidfd_) {
         identity.signingError = unboundReason_;
         return identity;
@@ -116,10 +121,7 @@ RelayPeerIdentity RelayPeer::launchedIdentity() const {
 }
 
 RelayPeerIdentity RelayPeer::executableIdentity() const {
-    RelayPeerIdentity identity;
-    identity.pid = pid_;
-    identity.effectiveUserId = uid_;
-    identity.groupId = gid_;
+    RelayPeerIdentity identity = credentials();
     if (!bound_) {
         identity.signingError = unboundReason_;
         return identity;

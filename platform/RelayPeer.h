@@ -80,6 +80,8 @@ class RelayPeer {
   private:
     RelayPeer() = default;
 
+    // The kernel's credentials alone, no identity yet.
+    RelayPeerIdentity credentials() const;
     RelayPeerIdentity executableIdentity() const;
     RelayPeerIdentity launchedIdentity() const;
 

@@ -81,6 +81,10 @@ uint64_t clearInfoValue(const BTHMetadataRef& container, const char* key) {
 
 }  // namespace
 
+BTHErrorRef BTHCodeSigningMigration::writeMappingIfStored(bool stored) {
+    return stored ? mapping_.writeCodeSigningMappingToDisk() : nullptr;
+}
+
 bool BTHCodeSigningMigration::hasValidEntry(const std::string& identifier) const {
     const auto& entries = mapping_.codeSigningMappingDict();
     const auto found = entries.find(identifier);
@@ -143,13 +147,10 @@ void BTHCodeSigningMigration::_migrateAppGroupIdsFromDataContainersToFile() {
             toClear.push_back(container);
         }
     }
-    if (stored) {
-        if (BTHErrorRef error = mapping_.writeCodeSigningMappingToDisk()) {
-            BTHLogError(
-                "Failed to write code signing mapping to disk following group id migration: %@",
-                error);
-            return;
-        }
+    if (BTHErrorRef error = writeMappingIfStored(stored)) {
+        BTHLogError("Failed to write code signing mapping to disk following group id migration: %@",
+                    error);
+        return;
     }
     for (const BTHMetadataRef& container : toClear) {
         const uint64_t code = clearInfoValue(container, kBTHLegacyGroupContainerIDsKey);
@@ -206,13 +207,10 @@ void BTHCodeSigningMigration::_migrateDataFromLegacyEntitlementsFileToCodeSignin
         mapping_.codeSigningMappingDict()[identifier] = std::move(entry);
         stored = true;
     }
-    if (stored) {
-        if (BTHErrorRef error = mapping_.writeCodeSigningMappingToDisk()) {
-            BTHLogError(
-                "Failed to write code signing mapping to disk following legacy migration: %@",
-                error);
-            return;
-        }
+    if (BTHErrorRef error = writeMappingIfStored(stored)) {
+        BTHLogError("Failed to write code signing mapping to disk following legacy migration: %@",
+                    error);
+        return;
     }
     BTHErrorRef removeError;
     if (!files.removeItemAtURL(legacy, &removeError))
@@ -263,14 +261,12 @@ void BTHCodeSigningMigration::_migrateCachedCodeSigningInfoFromBundleContainersT
             toClear.push_back(container);
         }
     }
-    if (stored) {
-        if (BTHErrorRef error = mapping_.writeCodeSigningMappingToDisk()) {
-            BTHLogError(
-                "Failed to write code signing mapping to disk following code signing migration: "
-                "%@",
-                error);
-            return;
-        }
+    if (BTHErrorRef error = writeMappingIfStored(stored)) {
+        BTHLogError(
+            "Failed to write code signing mapping to disk following code signing migration: "
+            "%@",
+            error);
+        return;
     }
     for (const BTHMetadataRef& container : toClear) {
         const uint64_t code = clearInfoValue(container, kBTHCachedCodeSigningInfoKey);

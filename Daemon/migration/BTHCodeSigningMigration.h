@@ -42,6 +42,9 @@ class BTHCodeSigningMigration {
     void _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
 
   private:
+    // Writes the mapping file when a step `stored` entries; its error, or
+    // null.
+    BTHErrorRef writeMappingIfStored(bool stored);
     // A valid entry exists for `identifier` (an invalid one may be replaced).
     bool hasValidEntry(const std::string& identifier) const;
 

@@ -345,7 +345,7 @@ TEST_F(BerthLaunchTest, OnlyAProgramSignedAsTheApplicationAndRootsAloneIsLaunche
     const fs::path unsignedProgram = bundled("com.example.plain", "/bin/true", "true", false);
     const fs::path other = bundled("com.example.other", "/bin/true", "true");
     const fs::path changed = bundled("com.example.changed", "/bin/true", "true");
-    std::ofstream(changed, std::ios::app) << "\n";
+    std::ofstream(changed, std::ofstream::app) << "\n";
     const fs::path writable = bundled("com.example.writable", "/bin/true", "true");
     fs::permissions(writable, fs::perms(0775));
     struct Case {
