@@ -13,8 +13,10 @@
 //
 //   daemon          a real berthd on a scratch device root (when its path is
 //                   given), with this program signed as a client holding
-//                   ".allowed": every request goes through the daemon's
-//                   intake (identity, entitlement check, command dispatch)
+//                   ".allowed": every request is a look-up of a container
+//                   that exists (command 0, not creating), through the
+//                   daemon's intake (identity, entitlement check, command
+//                   dispatch) and the container cache
 //
 //   relay_bench [seconds per measurement, default 2] [path of berthd]
 #include <signal.h>
@@ -162,11 +164,21 @@ struct Result {
     double p99Microseconds = 0;
 };
 
-Result measure(const std::filesystem::path& path, int clients, double seconds) {
+// Command 0 for the Data/Application container of the bench client and user
+// 501; `create` makes it when it is missing.
+Value lookupRequest(bool create) {
     Value request = Value::dictionary();
     request.set("Command", uint64_t{0});
+    request.set("ContainerClass", uint64_t{2});
+    request.set("UserID", uint64_t{501});
     request.set("Identifier", "sys.kelp.bench.client");
-    request.set("UserID", uint64_t{1});
+    request.set("CreateIfNecessary", create);
+    request.set("Transient", false);
+    return request;
+}
+
+Result measure(const std::filesystem::path& path, int clients, double seconds) {
+    const Value request = lookupRequest(false);
     std::vector<uint8_t> frame;
     relay::encodeFrame({relay::FrameKind::Request, 1, request}, frame);
 
@@ -216,7 +228,17 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
 class Daemon {
   public:
     Daemon(const std::filesystem::path& binary, const std::filesystem::path& root)
-        : prepared_(prepare(root)), daemon_(binary, root) {}
+        : prepared_(prepare(root)), daemon_(binary, root) {
+        // The container the look-ups find (1: success).
+        bench::BenchClient client(daemon_.socket());
+        const std::optional<Value> reply = client.exchange(lookupRequest(true));
+        const Value* error = reply ? reply->find("ReplyError") : nullptr;
+        if (!error || error->uint64Value() != uint64_t{1}) {
+            std::fprintf(stderr, "the daemon did not create the looked-up container (%s)\n",
+                         reply ? reply->description().c_str() : "no reply");
+            std::exit(1);
+        }
+    }
     const std::filesystem::path& socket() const { return daemon_.socket(); }
 
   private:
