@@ -106,6 +106,7 @@ CodeSigningRegistry::CodeSigningRegistry(Options options)
       launches_(std::move(options.launchRecordDirectory)),
       launchCgroupParent_(options.launchCgroupParent.empty() ? LaunchCgroup::configuredParent()
                                                              : options.launchCgroupParent),
+      racyWindow_(options.racyWindow),
       digests_(options.digestCacheCapacity, options.racyWindow) {}
 
 std::string CodeSigningRegistry::entryFileName(const std::string& key) {
@@ -113,24 +114,26 @@ std::string CodeSigningRegistry::entryFileName(const std::string& key) {
            kEntrySuffix;
 }
 
-UniqueFd CodeSigningRegistry::openTrustedDirectory(bool create, std::string* why,
-                                                   int* error) const {
+UniqueFd CodeSigningRegistry::openTrustedDirectory(bool create, std::string* why, int* error,
+                                                   IdentityBasis* basis) const {
     std::string reason;
-    UniqueFd directory = openRootOwnedDirectory(directory_, create, &reason, error, 0755);
+    UniqueFd directory = openRootOwnedDirectory(directory_, create, &reason, error, 0755, basis);
     if (!directory) setWhy(why, std::move(reason));
     return directory;
 }
 
 std::optional<SignatureEntry> CodeSigningRegistry::readEntry(int dirFd, const std::string& fileName,
-                                                             std::string* why,
-                                                             bool* missing) const {
+                                                             std::string* why, bool* missing,
+                                                             IdentityBasis* basis) const {
     std::string reason;
+    struct stat status {};
     const std::optional<std::vector<uint8_t>> bytes =
-        readRootOwnedFile(dirFd, fileName, kMaxEntryBytes, &reason, missing);
+        readRootOwnedFile(dirFd, fileName, kMaxEntryBytes, &reason, missing, &status);
     if (!bytes) {
         setWhy(why, std::move(reason));
         return std::nullopt;
     }
+    if (basis) basis->record(directory_.lexically_normal() / fileName, status);
     std::string parseError;
     std::optional<Value> dictionary = plist::parse(*bytes, &parseError);
     if (!dictionary || !dictionary->isDictionary()) {
@@ -264,9 +267,10 @@ CodeSigningRegistry::Listing CodeSigningRegistry::list() const {
 }
 
 std::optional<SignatureEntry> CodeSigningRegistry::entryByKey(const std::string& key,
-                                                              std::string* why) const {
+                                                              std::string* why,
+                                                              IdentityBasis* basis) const {
     int error = 0;
-    UniqueFd directory = openTrustedDirectory(false, why, &error);
+    UniqueFd directory = openTrustedDirectory(false, why, &error, basis);
     if (!directory) {
         if (error == ENOENT) setWhy(why, "no signature for " + key);
         return std::nullopt;
@@ -274,7 +278,8 @@ std::optional<SignatureEntry> CodeSigningRegistry::entryByKey(const std::string&
     const std::string fileName = entryFileName(key);
     std::string reason;
     bool missing = false;
-    std::optional<SignatureEntry> entry = readEntry(directory.get(), fileName, &reason, &missing);
+    std::optional<SignatureEntry> entry =
+        readEntry(directory.get(), fileName, &reason, &missing, basis);
     if (!entry) {
         setWhy(why, missing ? "no signature for " + key
                             : "the signature of " + key + " (" + fileName + ") is ignored: it " +
@@ -284,20 +289,21 @@ std::optional<SignatureEntry> CodeSigningRegistry::entryByKey(const std::string&
 }
 
 std::optional<SignatureEntry> CodeSigningRegistry::entryFor(
-    const std::filesystem::path& executablePath, std::string* why) const {
-    std::optional<SignatureEntry> entry = entryByKey(executablePath.string(), why);
+    const std::filesystem::path& executablePath, std::string* why, IdentityBasis* basis) const {
+    std::optional<SignatureEntry> entry = entryByKey(executablePath.string(), why, basis);
     if (entry && entry->isUnit()) return std::nullopt;  // never: file names differ
     return entry;
 }
 
 std::optional<SignatureEntry> CodeSigningRegistry::entryForUnit(const std::string& unit,
-                                                                std::string* why) const {
+                                                                std::string* why,
+                                                                IdentityBasis* basis) const {
     std::string reason;
     if (!isServiceUnitName(unit, &reason)) {
         setWhy(why, reason);
         return std::nullopt;
     }
-    std::optional<SignatureEntry> entry = entryByKey(unit, why);
+    std::optional<SignatureEntry> entry = entryByKey(unit, why, basis);
     if (entry && !entry->isUnit()) return std::nullopt;  // never: file names differ
     return entry;
 }
@@ -305,7 +311,12 @@ std::optional<SignatureEntry> CodeSigningRegistry::entryForUnit(const std::strin
 std::optional<PeerIdentity> CodeSigningRegistry::identify(pid_t pid, int pidfd, std::string* why) {
     std::optional<OpenedExecutable> executable = openProcessExecutable(pid, pidfd, why);
     if (!executable) return std::nullopt;
-    std::optional<SignatureEntry> entry = entryFor(executable->path, why);
+    // The process, and the path its entry is looked up by, still name this
+    // very file.
+    IdentityBasis basis;
+    basis.recordExecutable(executable->status);
+    basis.record(executable->path, executable->status);
+    std::optional<SignatureEntry> entry = entryFor(executable->path, why, &basis);
     if (!entry) return std::nullopt;
     std::optional<Sha256Digest> digest = digests_.digestOf(executable->fd.get(), why);
     if (!digest) return std::nullopt;
@@ -314,7 +325,7 @@ std::optional<PeerIdentity> CodeSigningRegistry::identify(pid_t pid, int pidfd, 
         return std::nullopt;
     }
     return PeerIdentity{std::move(entry->identifier), std::move(entry->entitlements),
-                        executable->id(), std::move(executable->path)};
+                        executable->id(), std::move(executable->path), settled(std::move(basis))};
 }
 
 std::optional<ExecutableId> CodeSigningRegistry::executableOf(pid_t pid, int pidfd,
@@ -342,9 +353,14 @@ std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunched(pid_t pid, int
         setWhy(why, reason);
         return std::nullopt;
     }
-    return origin.kind == CgroupOrigin::Kind::Launch
-               ? identifyLaunch(*cgroup, origin, uid, *mount, why)
-               : identifyUnit(*cgroup, origin, *mount, why);
+    IdentityBasis basis;
+    basis.recordCgroup(*cgroup);
+    std::optional<PeerIdentity> identity =
+        origin.kind == CgroupOrigin::Kind::Launch
+            ? identifyLaunch(*cgroup, origin, uid, *mount, &basis, why)
+            : identifyUnit(*cgroup, origin, *mount, &basis, why);
+    if (identity) identity->basis = settled(std::move(basis));
+    return identity;
 }
 
 std::optional<std::filesystem::path> CodeSigningRegistry::cgroup2Mount(std::string* why) const {
@@ -356,19 +372,17 @@ std::optional<std::filesystem::path> CodeSigningRegistry::cgroup2Mount(std::stri
 // A launch is believed when its group can have been filled by root alone,
 // its record is the one made for this very group, and the program the
 // launcher checked is still signed as it was then.
-std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(const std::string& cgroup,
-                                                                const CgroupOrigin& origin,
-                                                                uid_t uid,
-                                                                const std::filesystem::path& mount,
-                                                                std::string* why) const {
+std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(
+    const std::string& cgroup, const CgroupOrigin& origin, uid_t uid,
+    const std::filesystem::path& mount, IdentityBasis* basis, std::string* why) const {
     std::string reason;
-    const UniqueFd group = openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason);
+    const UniqueFd group = openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason, basis);
     struct stat status {};
     if (!group || ::fstat(group.get(), &status) != 0) {
         setWhy(why, reason.empty() ? "cannot open the control group /" + cgroup : reason);
         return std::nullopt;
     }
-    const std::optional<LaunchRecord> record = launches_.read(origin.launch, &reason);
+    const std::optional<LaunchRecord> record = launches_.read(origin.launch, &reason, basis);
     if (!record) {
         setWhy(why, reason);
         return std::nullopt;
@@ -384,7 +398,7 @@ std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(const std::strin
                         std::to_string(record->persona) + ", not " + std::to_string(uid));
         return std::nullopt;
     }
-    std::optional<SignatureEntry> entry = entryFor(record->executablePath, &reason);
+    std::optional<SignatureEntry> entry = entryFor(record->executablePath, &reason, basis);
     if (!entry) {
         setWhy(why, reason);
         return std::nullopt;
@@ -399,13 +413,14 @@ std::optional<PeerIdentity> CodeSigningRegistry::identifyLaunch(const std::strin
 std::optional<PeerIdentity> CodeSigningRegistry::identifyUnit(const std::string& cgroup,
                                                               const CgroupOrigin& origin,
                                                               const std::filesystem::path& mount,
+                                                              IdentityBasis* basis,
                                                               std::string* why) const {
     std::string reason;
-    if (!openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason)) {
+    if (!openTrustedCgroup(mount, cgroup, origin.trustedDepth, &reason, basis)) {
         setWhy(why, reason);
         return std::nullopt;
     }
-    std::optional<SignatureEntry> entry = entryForUnit(origin.unit, &reason);
+    std::optional<SignatureEntry> entry = entryForUnit(origin.unit, &reason, basis);
     if (!entry) {
         setWhy(why, reason);
         return std::nullopt;

@@ -56,6 +56,7 @@
 
 #include "core/Value.h"
 #include "platform/ExecutableIdentity.h"
+#include "platform/IdentityBasis.h"
 #include "platform/LaunchRecord.h"
 #include "platform/ProcessCgroup.h"
 
@@ -68,6 +69,9 @@ struct PeerIdentity {
     Value entitlements;  // always a dictionary
     ExecutableId executable;
     std::filesystem::path executablePath;
+    // What it was read from; empty when the service does not say, and the
+    // identity is then evaluated anew for every request.
+    IdentityBasis basis = {};
 };
 
 // What the message service asks of the code-signing service; tests of the
@@ -175,13 +179,15 @@ class CodeSigningRegistry final : public CodeSigningService {
     Listing list() const;
 
     // The entry stored for the canonical absolute path `executablePath`, if it
-    // counts. The path is used exactly as given.
+    // counts. The path is used exactly as given. What the answer was read
+    // from goes to `basis`, if given.
     std::optional<SignatureEntry> entryFor(const std::filesystem::path& executablePath,
-                                           std::string* why = nullptr) const;
+                                           std::string* why = nullptr,
+                                           IdentityBasis* basis = nullptr) const;
 
     // The entry of the unit `unit`, if it counts.
-    std::optional<SignatureEntry> entryForUnit(const std::string& unit,
-                                               std::string* why = nullptr) const;
+    std::optional<SignatureEntry> entryForUnit(const std::string& unit, std::string* why = nullptr,
+                                               IdentityBasis* basis = nullptr) const;
 
     std::optional<PeerIdentity> identify(pid_t pid, int pidfd, std::string* why = nullptr) override;
     std::optional<PeerIdentity> identifyLaunched(pid_t pid, int pidfd, uid_t uid,
@@ -199,22 +205,31 @@ class CodeSigningRegistry final : public CodeSigningService {
     }
 
   private:
-    UniqueFd openTrustedDirectory(bool create, std::string* why, int* error) const;
+    UniqueFd openTrustedDirectory(bool create, std::string* why, int* error,
+                                  IdentityBasis* basis = nullptr) const;
     // Reads and checks one entry file; `missing` tells a file that is not
     // there from one that does not count.
     std::optional<SignatureEntry> readEntry(int dirFd, const std::string& fileName,
-                                            std::string* why, bool* missing = nullptr) const;
+                                            std::string* why, bool* missing = nullptr,
+                                            IdentityBasis* basis = nullptr) const;
     // The entry looked up by `key` (a path or a unit's name).
-    std::optional<SignatureEntry> entryByKey(const std::string& key, std::string* why) const;
+    std::optional<SignatureEntry> entryByKey(const std::string& key, std::string* why,
+                                             IdentityBasis* basis = nullptr) const;
     int writeEntry(const SignatureEntry& entry, std::string* why);
     int removeByKey(const std::string& key, std::string* why);
     std::optional<PeerIdentity> identifyLaunch(const std::string& cgroup,
                                                const CgroupOrigin& origin, uid_t uid,
                                                const std::filesystem::path& mount,
-                                               std::string* why) const;
+                                               IdentityBasis* basis, std::string* why) const;
     std::optional<PeerIdentity> identifyUnit(const std::string& cgroup, const CgroupOrigin& origin,
                                              const std::filesystem::path& mount,
-                                             std::string* why) const;
+                                             IdentityBasis* basis, std::string* why) const;
+
+    // `basis`, settled against the registry's racy window.
+    IdentityBasis settled(IdentityBasis basis) const {
+        basis.settle(racyWindow_);
+        return basis;
+    }
 
     // The cgroup v2 mount, found on first use.
     std::optional<std::filesystem::path> cgroup2Mount(std::string* why) const;
@@ -224,6 +239,7 @@ class CodeSigningRegistry final : public CodeSigningService {
     std::string launchCgroupParent_;
     mutable std::mutex mountMutex_;
     mutable std::optional<std::filesystem::path> mount_;  // guarded by mountMutex_
+    std::chrono::nanoseconds racyWindow_;
     mutable DigestCache digests_;
 };
 

@@ -117,21 +117,25 @@ int LaunchRecords::write(const std::string& launch, const LaunchRecord& record,
     return error;
 }
 
-std::optional<LaunchRecord> LaunchRecords::read(const std::string& launch, std::string* why) const {
+std::optional<LaunchRecord> LaunchRecords::read(const std::string& launch, std::string* why,
+                                                IdentityBasis* basis) const {
     if (!isLaunchName(launch)) {
         setWhy(why, "\"" + launch + "\" is not a launch name");
         return std::nullopt;
     }
     int error = 0;
     std::string reason;
-    const UniqueFd directory = openRootOwnedDirectory(directory_, false, &reason, &error);
+    const UniqueFd directory =
+        openRootOwnedDirectory(directory_, false, &reason, &error, 0755, basis);
     if (!directory) {
         setWhy(why, error == ENOENT ? "no launch record for " + launch : reason);
         return std::nullopt;
     }
     bool missing = false;
-    const std::optional<std::vector<uint8_t>> bytes =
-        readRootOwnedFile(directory.get(), fileNameOf(launch), kMaxRecordBytes, &reason, &missing);
+    struct stat status {};
+    const std::optional<std::vector<uint8_t>> bytes = readRootOwnedFile(
+        directory.get(), fileNameOf(launch), kMaxRecordBytes, &reason, &missing, &status);
+    if (bytes && basis) basis->record(directory_.lexically_normal() / fileNameOf(launch), status);
     std::optional<Value> dictionary;
     if (bytes) dictionary = plist::parse(*bytes, &reason);
     std::optional<LaunchRecord> record;

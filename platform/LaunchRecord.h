@@ -30,6 +30,7 @@
 #include <vector>
 
 #include "platform/ExecutableIdentity.h"
+#include "platform/IdentityBasis.h"
 
 namespace berth {
 
@@ -62,7 +63,10 @@ class LaunchRecords {
               std::string* why = nullptr) const;
 
     // The record of launch `launch`, if it counts; nullopt with the reason.
-    std::optional<LaunchRecord> read(const std::string& launch, std::string* why = nullptr) const;
+    // What it was read from (its directories and file) goes to `basis`, if
+    // given.
+    std::optional<LaunchRecord> read(const std::string& launch, std::string* why = nullptr,
+                                     IdentityBasis* basis = nullptr) const;
 
     // Removes the record of `launch`. 0, ENOENT when there is none, or the
     // errno of the failing operation.

@@ -59,16 +59,23 @@ std::optional<std::string> readSmallFile(const std::string& path, std::string* w
     }
 }
 
-// The group open at `fd` and its "cgroup.procs" are root's alone.
-bool isTrustedLevel(int fd, const std::string& shown, std::string* why) {
+// The group open at `fd` (at `path`) and its "cgroup.procs" are root's
+// alone; both are recorded in `basis`, if given.
+bool isTrustedLevel(int fd, const std::filesystem::path& path, const std::string& shown,
+                    std::string* why, IdentityBasis* basis) {
     struct stat status {};
     if (::fstat(fd, &status) != 0 || !S_ISDIR(status.st_mode) || !isRootsAlone(status)) {
         *why = "the control group " + shown + " is not root's alone";
         return false;
     }
-    if (::fstatat(fd, "cgroup.procs", &status, AT_SYMLINK_NOFOLLOW) != 0 || !isRootsAlone(status)) {
+    struct stat procs {};
+    if (::fstatat(fd, "cgroup.procs", &procs, AT_SYMLINK_NOFOLLOW) != 0 || !isRootsAlone(procs)) {
         *why = "processes can be moved into " + shown + " by users other than root";
         return false;
+    }
+    if (basis) {
+        basis->record(path, status);
+        basis->record(path / "cgroup.procs", procs);
     }
     return true;
 }
@@ -91,11 +98,17 @@ std::optional<std::string> cgroupOfProcess(pid_t pid, int pidfd, std::string* wh
         *why = "invalid pid " + std::to_string(pid);
         return std::nullopt;
     }
+    std::optional<std::string> path = cgroupShownFor(pid, why);
+    if (!path) return std::nullopt;
+    // Only now is it known that the pid still named the pidfd's process.
+    if (!pidfdRefersTo(pidfd, pid, why)) return std::nullopt;
+    return path;
+}
+
+std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why) {
     const std::optional<std::string> text =
         readSmallFile("/proc/" + std::to_string(pid) + "/cgroup", why);
     if (!text) return std::nullopt;
-    // Only now is it known that the pid still named the pidfd's process.
-    if (!pidfdRefersTo(pidfd, pid, why)) return std::nullopt;
     std::optional<std::string> path = unifiedCgroupIn(*text);
     if (!path) *why = "process " + std::to_string(pid) + " is in no cgroup v2 group";
     return path;
@@ -153,14 +166,15 @@ CgroupOrigin classifyCgroup(std::string_view path, std::string_view launchParent
 }
 
 UniqueFd openTrustedCgroup(const std::filesystem::path& mount, std::string_view path, size_t depth,
-                           std::string* why) {
+                           std::string* why, IdentityBasis* basis) {
     UniqueFd current(::open(mount.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!current) {
         *why = "cannot open " + mount.string() + ": " + strerror(errno);
         return {};
     }
     std::string shown = "/";
-    if (!isTrustedLevel(current.get(), shown, why)) return {};
+    std::filesystem::path at = mount;
+    if (!isTrustedLevel(current.get(), at, shown, why, basis)) return {};
     const std::vector<std::string_view> parts = componentsOf(path);
     if (depth > parts.size()) {
         *why = "the control group /" + std::string(path) + " is not that deep";
@@ -175,7 +189,8 @@ UniqueFd openTrustedCgroup(const std::filesystem::path& mount, std::string_view 
             *why = "cannot open the control group " + shown + ": " + strerror(errno);
             return {};
         }
-        if (!isTrustedLevel(next.get(), shown, why)) return {};
+        at /= name;
+        if (!isTrustedLevel(next.get(), at, shown, why, basis)) return {};
         current = std::move(next);
     }
     return current;

@@ -28,6 +28,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/IdentityBasis.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -41,6 +42,10 @@ std::optional<std::string> unifiedCgroupIn(std::string_view text);
 // the answer belonged to that process and not to one that inherited its pid.
 // nullopt with the reason.
 std::optional<std::string> cgroupOfProcess(pid_t pid, int pidfd, std::string* why);
+
+// The group /proc shows for `pid` now, unconfirmed: whoever holds the pid at
+// that moment. The caller confirms the process afterwards.
+std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why);
 
 // Whether `name` can name a unit whose processes may be bound to an
 // identity: a service or scope unit name of the service manager ("a.service",
@@ -73,8 +78,8 @@ bool isLaunchName(std::string_view name);
 // `mount`, one at a time without following links, and requires the root and
 // each of them to be a directory root's alone whose "cgroup.procs" is root's
 // alone too. Gives the deepest one opened, or an invalid descriptor with the
-// reason.
+// reason. Every level trusted is recorded in `basis`, if given.
 UniqueFd openTrustedCgroup(const std::filesystem::path& mount, std::string_view path, size_t depth,
-                           std::string* why);
+                           std::string* why, IdentityBasis* basis = nullptr);
 
 }  // namespace berth

@@ -85,7 +85,22 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
 }
 
 RelayPeerIdentity RelayPeer::identity() const {
-    return uid_ == 0 ? executableIdentity() : launchedIdentity();
+    std::lock_guard lock(remembered_->mutex);
+    std::optional<RelayPeerIdentity>& remembered = remembered_->identity;
+    if (remembered && remembered_->basis.holds(pid_, pidfd_.get())) return *remembered;
+    IdentityBasis basis;
+    RelayPeerIdentity evaluated = evaluate(&basis);
+    if (evaluated.signingIdentifier && basis.settled()) {
+        remembered = evaluated;
+        remembered_->basis = std::move(basis);
+    } else {
+        remembered.reset();
+    }
+    return evaluated;
+}
+
+RelayPeerIdentity RelayPeer::evaluate(IdentityBasis* basis) const {
+    return uid_ == 0 ? executableIdentity(basis) : launchedIdentity(basis);
 }
 
 RelayPeerIdentity RelayPeer::credentials() const {
@@ -96,7 +111,7 @@ RelayPeerIdentity RelayPeer::credentials() const {
     return identity;
 }
 
-RelayPeerIdentity RelayPeer::launchedIdentity() const {
+RelayPeerIdentity RelayPeer::launchedIdentity(IdentityBasis* basis) const {
     RelayPeerIdentity identity = credentials();
     if (!pidfd_) {
         identity.signingError = unboundReason_;
@@ -108,6 +123,7 @@ RelayPeerIdentity RelayPeer::launchedIdentity() const {
         identity.processStillBound = true;
         identity.signingIdentifier = std::move(started->identifier);
         identity.entitlements = std::move(started->entitlements);
+        *basis = std::move(started->basis);
         return identity;
     }
     std::string gone;
@@ -120,7 +136,7 @@ RelayPeerIdentity RelayPeer::launchedIdentity() const {
     return identity;
 }
 
-RelayPeerIdentity RelayPeer::executableIdentity() const {
+RelayPeerIdentity RelayPeer::executableIdentity(IdentityBasis* basis) const {
     RelayPeerIdentity identity = credentials();
     if (!bound_) {
         identity.signingError = unboundReason_;
@@ -136,6 +152,7 @@ RelayPeerIdentity RelayPeer::executableIdentity() const {
         identity.processStillBound = true;
         identity.signingIdentifier = std::move(signedAs->identifier);
         identity.entitlements = std::move(signedAs->entitlements);
+        *basis = std::move(signedAs->basis);
         return identity;
     }
     // No signature, or no process: only a live process still running the

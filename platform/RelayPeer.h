@@ -8,12 +8,18 @@
 //     pidfd_open(pid) confirmed against the credentials), so that a pid
 //     recycled after the peer exits cannot stand in for it.
 //
-// The peer's signing identity (identifier and entitlements) is evaluated
-// anew for every request through the code-signing service, and only while
+// The peer's signing identity (identifier and entitlements) holds only while
 // the process that connected is alive: a socket that outlives it, passed to
 // another process, carries no identity at all, and every request on it must
-// be refused. How the identity is found depends on the uid the peer
-// connected with:
+// be refused. It is evaluated through the code-signing service once, and
+// then checked for every request against what it was read from (see
+// IdentityBasis): the process still alive and running the same file or in
+// the same group, and every file and directory the answer rested on
+// unchanged. When any of it changed - the program exec'd another or was
+// replaced on disk, its entry was re-signed or withdrawn, a launch record or
+// an owner or mode on the way changed - the request evaluates it anew, so
+// every such change applies to the very next request. How the identity is found depends on the uid
+// the peer connected with:
 //
 //   - root (uid 0) is trusted, and is the executable it runs: the file is
 //     bound to the connection at accept (not at connect(), which only a root
@@ -30,6 +36,7 @@
 #include <sys/types.h>
 
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 
@@ -82,8 +89,17 @@ class RelayPeer {
 
     // The kernel's credentials alone, no identity yet.
     RelayPeerIdentity credentials() const;
-    RelayPeerIdentity executableIdentity() const;
-    RelayPeerIdentity launchedIdentity() const;
+    // A full evaluation; what a signed identity rests on goes to `basis`.
+    RelayPeerIdentity evaluate(IdentityBasis* basis) const;
+    RelayPeerIdentity executableIdentity(IdentityBasis* basis) const;
+    RelayPeerIdentity launchedIdentity(IdentityBasis* basis) const;
+
+    // The last signed identity, while its basis holds.
+    struct Remembered {
+        std::mutex mutex;
+        std::optional<RelayPeerIdentity> identity;  // guarded by mutex
+        IdentityBasis basis;                        // guarded by mutex
+    };
 
     pid_t pid_ = 0;
     uid_t uid_ = 0;
@@ -92,6 +108,7 @@ class RelayPeer {
     std::optional<ExecutableId> bound_;  // root's peers only
     std::string unboundReason_;          // why there is no identity to be had
     std::shared_ptr<CodeSigningService> signing_;
+    std::unique_ptr<Remembered> remembered_ = std::make_unique<Remembered>();
 };
 
 }  // namespace berth

@@ -52,7 +52,7 @@ bool isRootsAlone(const struct stat& status) {
 }
 
 UniqueFd openRootOwnedDirectory(const std::filesystem::path& directory, bool create,
-                                std::string* why, int* error, mode_t mode) {
+                                std::string* why, int* error, mode_t mode, IdentityBasis* basis) {
     const std::filesystem::path target = directory.lexically_normal();
     const std::filesystem::path& root = DeviceRoot::path();
     const std::filesystem::path prefix = isBelow(target, root) ? root : "/";
@@ -79,6 +79,7 @@ UniqueFd openRootOwnedDirectory(const std::filesystem::path& directory, bool cre
             return failed(errnum, "cannot open " + walked.string() + ": " + strerror(errnum));
         }
         if (!isRootsAlone(status)) return failed(EPERM, walked.string() + " is not root's alone");
+        if (basis) basis->record(walked, status);
         current = std::move(next);
     }
     UniqueFd opened(::openat(current.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -90,8 +91,8 @@ UniqueFd openRootOwnedDirectory(const std::filesystem::path& directory, bool cre
 }
 
 std::optional<std::vector<uint8_t>> readRootOwnedFile(int dirFd, const std::string& name,
-                                                      size_t limit, std::string* why,
-                                                      bool* missing) {
+                                                      size_t limit, std::string* why, bool* missing,
+                                                      struct stat* checked) {
     if (missing) *missing = false;
     UniqueFd fd(
         ::openat(dirFd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
@@ -110,6 +111,7 @@ std::optional<std::vector<uint8_t>> readRootOwnedFile(int dirFd, const std::stri
         *why = "is not root's alone (owner or mode)";
         return std::nullopt;
     }
+    if (checked) *checked = status;
     std::vector<uint8_t> bytes;
     if (!readAll(fd.get(), bytes, limit)) {
         *why = std::string("cannot be read: ") + strerror(errno);

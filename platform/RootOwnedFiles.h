@@ -16,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/IdentityBasis.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -28,17 +29,20 @@ bool isRootsAlone(const struct stat& status);
 // links, and refusing every component that is not root's alone (EPERM). With
 // `create`, missing components are made with mode `mode`. On failure the
 // descriptor is invalid, `*error` holds the errno value and `*why` the
-// reason.
+// reason. Each component that was trusted is recorded in `basis`, if given.
 UniqueFd openRootOwnedDirectory(const std::filesystem::path& directory, bool create,
-                                std::string* why, int* error, mode_t mode = 0755);
+                                std::string* why, int* error, mode_t mode = 0755,
+                                IdentityBasis* basis = nullptr);
 
 // The bytes of `name` in the directory `dirFd`, which must be a regular file
 // reached without a link, root's alone and at most `limit` bytes long.
 // nullopt with the reason otherwise; `*missing` (when given) tells a file
-// that is not there from one that does not count.
+// that is not there from one that does not count. `*status` (when given)
+// receives the file's status as it was checked, before it was read.
 std::optional<std::vector<uint8_t>> readRootOwnedFile(int dirFd, const std::string& name,
                                                       size_t limit, std::string* why,
-                                                      bool* missing = nullptr);
+                                                      bool* missing = nullptr,
+                                                      struct stat* status = nullptr);
 
 // Replaces `name` in `dirFd` with `bytes` (mode 0644) so that a reader, or
 // the next boot after a crash, finds either the old file or the new one

@@ -330,9 +330,36 @@ void WorkQueue::checkSyncWouldFinish() const {
     }
 }
 
+bool WorkQueue::trySyncInline(void (*call)(void*), void* context) {
+    if (kind_ != Kind::serial || global_ || executor_) return false;
+    {
+        std::lock_guard lock(mutex_);
+        // Background work keeps its lower priority on its own threads.
+        if (suspendCount_ > 0 || draining_ || !pending_.empty() ||
+            target_ != global(QueuePriority::normal))
+            return false;
+        // Claimed as a drain would be: items submitted meanwhile wait.
+        draining_ = true;
+    }
+    // Lets go of the queue, scheduling what arrived while `call` ran, even
+    // when it throws.
+    struct Release {
+        WorkQueue* queue;
+        ~Release() {
+            std::unique_lock lock(queue->mutex_);
+            queue->draining_ = false;
+            queue->schedule(std::move(lock));
+        }
+    } release{this};
+    RunningFrame frame(this);
+    call(context);
+    return true;
+}
+
 void WorkQueue::syncInvoke(void (*call)(void*), void* context) {
     checkSyncWouldFinish();
     const auto self = shared_from_this();
+    if (trySyncInline(call, context)) return;
     SyncWait wait;
     async(SyncItem(&wait, call, context, &tlsContext));
     wait.await();

@@ -102,7 +102,10 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
     void async(WorkItem item);
 
     // Submits `fn`, waits until it has run and returns its result; an
-    // exception it throws is rethrown here.
+    // exception it throws is rethrown here. On an idle serial queue over the
+    // normal global queue, `fn` runs on the calling thread (nothing of the queue
+    // can run meanwhile, as if the queue's own thread ran it), so a sync
+    // costs no thread hop when nobody else holds the queue.
     template <class F>
     std::invoke_result_t<F&> sync(F&& fn);
 
@@ -115,6 +118,10 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
   private:
     // Entry point of a type-erased synchronous call.
     void syncInvoke(void (*call)(void*), void* context);
+    // Runs `call` on the calling thread when the queue is a serial queue
+    // over the normal global queue with nothing pending, running or suspending it;
+    // false (nothing run) otherwise.
+    bool trySyncInline(void (*call)(void*), void* context);
     void checkSyncWouldFinish() const;
 
     // Hands the work that pending items need (a drain, or runners) to the

@@ -179,7 +179,7 @@ class CreateOrLookup {
           identifier_(identifier),
           containerClass_(containerClass),
           transient_(transient),
-          classDirectory_(BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+          classDirectory_(BTHGlobalConfiguration::sharedInstance().containerDirectoryPathForUser(
               userId, containerClass, transient)) {}
 
     enum class Found { kNone, kContainer, kFailure };
@@ -234,6 +234,11 @@ class CreateOrLookup {
     // durable there, so the rename into place is the last change it needs.
     bool stage(BTHErrorRef* error) {
         BTH_FUNCTION(kCreateFunction);
+        // Only a container about to be made needs its class directory in
+        // place: made here, with its parents, when missing (a failure shows
+        // when the staged container cannot be moved into it).
+        BTHGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
+            userId_, containerClass_, transient_);
         directoryName_ = Uuid::random().string();
         const std::filesystem::path staging =
             BTHGlobalConfiguration::sharedInstance().stagingDirectory() / directoryName_;

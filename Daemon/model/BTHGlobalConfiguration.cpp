@@ -183,6 +183,15 @@ BTHGlobalConfiguration::OptionalPath BTHGlobalConfiguration::containerDirectoryU
     return directory;
 }
 
+BTHGlobalConfiguration::OptionalPath BTHGlobalConfiguration::containerDirectoryPathForUser(
+    uid_t userId, uint64_t containerClass, bool transient) {
+    if (!BTHContainerClassIsPerUser(containerClass))
+        return globalContainerBaseURLWithContentClass(containerClass, transient);
+    std::shared_ptr<BTHPerUserConfiguration> user = getPerUserConfigurationForUserId(userId);
+    return user ? user->containerDirectoryPathForContentClass(containerClass, transient)
+                : std::nullopt;
+}
+
 const std::vector<std::string>& BTHGlobalConfiguration::appUserDataItemNames() {
     static const std::vector<std::string> names{"Documents", "Library", "tmp", "Merchantry"};
     return names;

@@ -79,6 +79,10 @@ class BTHGlobalConfiguration {
     // classes); per-user classes are the user's. Null for invalid classes.
     OptionalPath containerDirectoryURLForUser(uid_t userId, uint64_t containerClass,
                                               bool transient);
+    // The same directory's path alone, nothing created: a look-up that finds
+    // its container needs no more.
+    OptionalPath containerDirectoryPathForUser(uid_t userId, uint64_t containerClass,
+                                               bool transient);
 
     // The top-level items of an application data container that hold the
     // user's data: "Documents", "Library", "tmp", "Merchantry".

@@ -14,6 +14,9 @@ namespace berth {
 namespace {
 
 constexpr size_t kMaxHomePathLength = 1024;
+// Below the home: the containers, and the transient containers.
+constexpr const char* kContainersBelowHome = "Containers";
+constexpr const char* kTransientBelowHome = "Library/Caches/sys.kelp.berthd/Temp";
 
 bool isInsideDeviceRoot(const std::filesystem::path& path) {
     if (DeviceRoot::isHost()) return true;
@@ -65,7 +68,7 @@ void BTHPerUserConfiguration::create(const std::filesystem::path& path, const ch
 
 BTHPerUserConfiguration::OptionalPath BTHPerUserConfiguration::userBaseDirectory() {
     std::lock_guard lock(mutex_);
-    if (!userBaseDirectory_) userBaseDirectory_ = underHome("Containers");
+    if (!userBaseDirectory_) userBaseDirectory_ = underHome(kContainersBelowHome);
     if (userBaseDirectory_)
         create(*userBaseDirectory_, "-[BTHPerUserConfiguration userBaseDirectory]",
                "Failed to create user base dir at \"%@\": %@");
@@ -74,8 +77,7 @@ BTHPerUserConfiguration::OptionalPath BTHPerUserConfiguration::userBaseDirectory
 
 BTHPerUserConfiguration::OptionalPath BTHPerUserConfiguration::transientDirectory() {
     std::lock_guard lock(mutex_);
-    if (!transientDirectory_)
-        transientDirectory_ = underHome("Library/Caches/sys.kelp.berthd/Temp");
+    if (!transientDirectory_) transientDirectory_ = underHome(kTransientBelowHome);
     if (transientDirectory_)
         create(*transientDirectory_, "-[BTHPerUserConfiguration transientDirectory]",
                "Failed to create transient dir at \"%@\": %@");
@@ -123,6 +125,15 @@ BTHPerUserConfiguration::OptionalPath BTHPerUserConfiguration::containerDirector
     std::filesystem::path directory = *base / BTHContainerClassName(containerClass);
     create(directory, bthFunctionName, "Failed to create container dir at \"%@\": %@");
     return directory;
+}
+
+BTHPerUserConfiguration::OptionalPath
+BTHPerUserConfiguration::containerDirectoryPathForContentClass(uint64_t containerClass,
+                                                               bool transient) const {
+    if (!BTHContainerClassIsPerUser(containerClass)) return std::nullopt;
+    OptionalPath base = underHome(transient ? kTransientBelowHome : kContainersBelowHome);
+    if (!base) return std::nullopt;
+    return *base / BTHContainerClassName(containerClass);
 }
 
 }  // namespace berth

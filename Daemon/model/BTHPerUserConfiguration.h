@@ -57,6 +57,9 @@ class BTHPerUserConfiguration {
     // with parents, mode 0755, owned by the user. Null, with an error line,
     // for any other class.
     OptionalPath containerDirectoryURLForContentClass(uint64_t containerClass, bool transient);
+    // The same directory's path alone; nothing is created.
+    OptionalPath containerDirectoryPathForContentClass(uint64_t containerClass,
+                                                       bool transient) const;
 
   private:
     OptionalPath underHome(const char* relative) const;

@@ -2,7 +2,9 @@
 // program act as clients (signed in the scratch root's registry or not, run
 // by root or by another user, in launch groups and units or not) and
 // connect, exec, fork and exit while the server asks for their identity on
-// every request.
+// every request. The registry here has no racy window, so a connection
+// keeps the identity it was given from its first request on, and every
+// change below must still reach the very next request.
 #include <fcntl.h>
 #include <grp.h>
 #include <signal.h>
@@ -13,6 +15,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fstream>
 
 #include "CgroupSupport.h"
 #include "RelayTestServer.h"
@@ -210,8 +213,9 @@ class RelayIdentityTest : public ::testing::Test {
     test::ScratchDir bin_;
     std::filesystem::path unsigned_;
     std::filesystem::path signed_;
-    std::shared_ptr<CodeSigningRegistry> registry_ = std::make_shared<CodeSigningRegistry>(
-        CodeSigningRegistry::Options{.directory = {}, .launchCgroupParent = kLaunchParent});
+    std::shared_ptr<CodeSigningRegistry> registry_ =
+        std::make_shared<CodeSigningRegistry>(CodeSigningRegistry::Options{
+            .directory = {}, .launchCgroupParent = kLaunchParent, .racyWindow = {}});
     std::unique_ptr<RelayTestServer> server_;
     std::mutex mutex_;
     std::map<uint64_t, RelayPeerIdentity> seen_;
@@ -235,6 +239,65 @@ TEST_F(RelayIdentityTest, ASignedPeerIsIdentifiedAfreshOnEveryRequest) {
     sign(entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
     ASSERT_EQ(client.command("send 2"), "ok");
     EXPECT_EQ(seen(2).entitlements, entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
+}
+
+TEST_F(RelayIdentityTest, ABinaryReplacedOnDiskAfterConnectIsNotTrustedWithTheOldSignature) {
+    ClientProcess client(signed_, server_->path(), signed_);
+    ASSERT_EQ(client.readLine(), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+    ASSERT_EQ(seen(1).signingIdentifier, "sys.kelp.test.client");
+
+    // New contents at the signed path, the way an update lands: the running
+    // process keeps the old file, which is no longer the one signed there.
+    const std::filesystem::path update = bin_ / "update";
+    std::filesystem::copy_file(unsigned_, update);
+    std::ofstream(update, std::ofstream::app) << "changed";
+    std::filesystem::permissions(update, std::filesystem::perms(0755));
+    std::filesystem::rename(update, signed_);
+    ASSERT_EQ(client.command("send 2"), "ok");
+    const RelayPeerIdentity replaced = seen(2);
+    EXPECT_FALSE(replaced.signingIdentifier);
+    EXPECT_FALSE(replaced.entitlements);
+    EXPECT_NE(replaced.signingError.find("deleted or replaced"), std::string::npos)
+        << replaced.signingError;
+
+    // Running the new file under the signed path is not the signature
+    // either, and neither is the old one moved back somewhere else.
+    ASSERT_EQ(client.command("exec"), "connected");
+    ASSERT_EQ(client.command("send 3"), "ok");
+    expectUnbound(seen(3), client.pid(), "another executable");
+}
+
+TEST_F(RelayIdentityTest, ASignatureWithdrawnOrMovedAwayAppliesToTheNextRequest) {
+    ClientProcess client(signed_, server_->path());
+    ASSERT_EQ(client.readLine(), "connected");
+    uint64_t tag = 1;
+    auto identifierNow = [&] {
+        EXPECT_EQ(client.command("send " + std::to_string(tag)), "ok");
+        return seen(tag++).signingIdentifier;
+    };
+    ASSERT_EQ(identifierNow(), "sys.kelp.test.client");
+    ASSERT_EQ(identifierNow(), "sys.kelp.test.client");
+
+    ASSERT_EQ(registry_->remove(signed_), 0);
+    EXPECT_FALSE(identifierNow());
+    sign(entitlementsAllowing("sys.kelp.private.Berth.allowed"));
+    EXPECT_EQ(identifierNow(), "sys.kelp.test.client");
+
+    // The program moved to another path (its entry names the old one).
+    const std::filesystem::path moved = bin_ / "moved-client";
+    std::filesystem::rename(signed_, moved);
+    EXPECT_FALSE(identifierNow());
+    std::filesystem::rename(moved, signed_);
+
+    // A registry directory others could write into stops counting at once.
+    const std::filesystem::path directory = registry_->directory();
+    std::filesystem::permissions(directory, std::filesystem::perms::others_write,
+                                 std::filesystem::perm_options::add);
+    EXPECT_FALSE(identifierNow());
+    std::filesystem::permissions(directory, std::filesystem::perms::others_write,
+                                 std::filesystem::perm_options::remove);
+    EXPECT_EQ(identifierNow(), "sys.kelp.test.client");
 }
 
 TEST_F(RelayIdentityTest, AnUnsignedPeerThatExecsASignedProgramGainsNothing) {

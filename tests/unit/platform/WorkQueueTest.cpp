@@ -135,6 +135,43 @@ TEST(WorkQueueTest, SyncReturnsResultAfterEarlierItemsAndPassesOnExceptions) {
     EXPECT_EQ(queue->sync([&] { return counter; }), 100);
 }
 
+TEST(WorkQueueTest, SyncOntoAnIdleSerialQueueRunsOnTheCallerAndHoldsTheQueue) {
+    auto queue = WorkQueue::makeSerial("test.sync.inline");
+    Event entered, release;
+    std::vector<int> order;  // touched only on the queue
+    std::thread::id ranOn;
+    bool current = false;
+    std::thread caller([&] {
+        queue->sync([&] {
+            ranOn = std::this_thread::get_id();
+            current = queue->isCurrent();
+            entered.set();
+            release.wait(kBlocked);
+            order.push_back(1);
+        });
+    });
+    ASSERT_TRUE(entered.wait());
+    // Submitted while the sync holds the queue: runs after it, not beside it.
+    Event ranAfter;
+    queue->async([&] {
+        order.push_back(2);
+        ranAfter.set();
+    });
+    giveChanceToMisbehave();
+    EXPECT_FALSE(ranAfter.isSet()) << "an item ran while a sync held the serial queue";
+    release.set();
+    ASSERT_TRUE(ranAfter.wait());
+    const std::thread::id callerId = caller.get_id();
+    caller.join();
+    EXPECT_EQ(ranOn, callerId);
+    EXPECT_TRUE(current);
+    EXPECT_EQ(order, (std::vector<int>{1, 2}));
+    // Once the drain that ran the item has let go, syncs run inline again.
+    EXPECT_TRUE(eventually([&] {
+        return queue->sync([] { return std::this_thread::get_id(); }) == std::this_thread::get_id();
+    }));
+}
+
 TEST(WorkQueueTest, SyncOntoConcurrentQueueFromItsOwnItemFinishes) {
     auto queue = WorkQueue::makeConcurrent("test.concurrent.reentry");
     const int result = queue->sync([&] { return queue->sync([] { return 41; }) + 1; });

@@ -1,0 +1,79 @@
+// What a peer's identity was read from, so that the next request of the same
+// connection can tell, with a few stat calls, that evaluating the identity
+// anew would give the same answer.
+//
+// An identity rests on files and directories: the executable a root peer
+// runs and the path it is signed by, the registry entry and every directory
+// whose ownership made it trusted, a launch record and its directories, the
+// control groups (and their "cgroup.procs") whose ownership proved who
+// placed the process. Each is recorded as the evaluation saw it, by a path
+// it can be found at again, before its contents were read. Any later write,
+// rename, replacement, removal, chmod or chown gives another version at that
+// path, so a basis that still holds stands for an evaluation that would
+// read the same bytes under the same owners.
+//
+// Contents are told apart by their change time, which only the kernel sets.
+// A regular file changed within `window` of its recording could change again
+// within the same timestamp tick and keep its version; a basis holding such
+// a file is not settled, and the identity is then evaluated anew next time.
+#pragma once
+
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace berth {
+
+// One version of a file or directory: its identity, size, times, mode and
+// owner.
+struct FileVersion {
+    dev_t device = 0;
+    ino_t inode = 0;
+    off_t size = 0;
+    int64_t mtimeNs = 0;
+    int64_t ctimeNs = 0;
+    mode_t mode = 0;
+    uid_t owner = 0;
+    gid_t group = 0;
+
+    static FileVersion of(const struct stat& status);
+    friend bool operator==(const FileVersion&, const FileVersion&) = default;
+};
+
+class IdentityBasis {
+  public:
+    // Records `path` as `status` shows it; `status` must come from the very
+    // object the evaluation went on to trust or read.
+    void record(std::filesystem::path path, const struct stat& status);
+    // Records the file the process runs, as /proc/<pid>/exe resolves it.
+    void recordExecutable(const struct stat& status);
+    // Records the control group the process was found in.
+    void recordCgroup(std::string cgroup);
+
+    // Called once the evaluation is over: the basis is settled when
+    // something was recorded and no regular file among it changed within
+    // `window` of now.
+    void settle(std::chrono::nanoseconds window);
+    // Only a settled basis may stand for a later evaluation.
+    bool settled() const { return settled_; }
+
+    // Whether everything recorded is still as it was, for the process `pid`
+    // that `pidfd` refers to. The process is confirmed alive last, so what
+    // /proc showed of `pid` was its own.
+    bool holds(pid_t pid, int pidfd) const;
+
+  private:
+    std::vector<std::pair<std::filesystem::path, FileVersion>> files_;
+    std::optional<FileVersion> executable_;
+    std::optional<std::string> cgroup_;
+    bool settled_ = false;
+};
+
+}  // namespace berth
