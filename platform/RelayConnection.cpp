@@ -80,7 +80,7 @@ void RelayConnection::resume() {
         resumed_ = true;
         if (!closed_) {
             interest_ = EPOLLIN;
-            token_ = poller_->add(socket_.get(), interest_, shared_from_this());
+            token_ = poller_->add(socket_.get(), interest_ | EPOLLONESHOT, shared_from_this());
             if (token_ == 0)
                 closeLocked(kLogError,
                             std::string("cannot watch the connection: ") + strerror(errno),
@@ -132,21 +132,41 @@ bool RelayConnection::sendReply(uint64_t messageId, const Value& body) {
 }
 
 void RelayConnection::ready(uint32_t events) {
-    Released released(*this);
-    std::lock_guard lock(mutex_);
-    if (closed_) return;
-    if ((events & EPOLLOUT) && !flushLocked(released)) return;
-    if (events & EPOLLIN) {
-        readLocked(released);
-    } else if (events & (EPOLLHUP | EPOLLERR)) {
-        closeLocked(kLogDebug, "the peer hung up", released);
+    std::optional<RelayEvent> runHere;
+    {
+        Released released(*this);
+        std::lock_guard lock(mutex_);
+        if (closed_) return;
+        if ((events & EPOLLOUT) && !flushLocked(released)) return;
+        if (events & EPOLLIN) {
+            readLocked(released, &runHere);
+        } else if (events & (EPOLLHUP | EPOLLERR)) {
+            closeLocked(kLogDebug, "the peer hung up", released);
+        }
+        chargeLocked(released);
+        updateInterestLocked(true);
     }
-    chargeLocked(released);
-    updateInterestLocked();
+    if (runHere) runInline(*runHere);
 }
 
-void RelayConnection::readLocked(Released& released) {
-    // Reads happen on the poller's thread only; one buffer serves them all.
+void RelayConnection::runInline(const RelayEvent& event) {
+    struct GiveBack {
+        RelayPoller& poller;
+        ~GiveBack() { poller.releaseInline(); }
+    } giveBack{*poller_};
+    queue_->runClaimed([&] { deliver(event); });
+}
+
+bool RelayConnection::claimInlineLocked() {
+    if (queued_ != 0 || !poller_->reserveInline()) return false;
+    if (queue_->tryClaim()) return true;
+    poller_->releaseInline();
+    return false;
+}
+
+void RelayConnection::readLocked(Released& released, std::optional<RelayEvent>* runHere) {
+    // Reads happen on the poller's threads only; one buffer per thread
+    // serves them all.
     thread_local std::vector<uint8_t> chunk;
     if (chunk.size() < options_.limits.readChunk) chunk.resize(options_.limits.readChunk);
     const ssize_t count = ::read(socket_.get(), chunk.data(), options_.limits.readChunk);
@@ -157,11 +177,11 @@ void RelayConnection::readLocked(Released& released) {
             closeLocked(kLogDebug, std::string("read failed: ") + strerror(errno), released);
     } else {
         decoder_.feed(std::span<const uint8_t>(chunk.data(), static_cast<size_t>(count)));
-        pumpLocked(released);
+        pumpLocked(released, runHere);
     }
 }
 
-void RelayConnection::pumpLocked(Released& released) {
+void RelayConnection::pumpLocked(Released& released, std::optional<RelayEvent>* runHere) {
     while (!closed_ && queued_ < options_.limits.maxQueuedRequests) {
         relay::Frame frame;
         const relay::FrameDecoder::Status status = decoder_.next(frame);
@@ -176,8 +196,14 @@ void RelayConnection::pumpLocked(Released& released) {
             closeLocked(kLogError, "protocol error: a reply frame from a client", released);
             return;
         }
+        RelayEvent event = RelayEvent::message(shared_from_this(), std::move(frame));
+        if (runHere && !*runHere && claimInlineLocked()) {
+            ++queued_;
+            runHere->emplace(std::move(event));
+            continue;
+        }
         ++queued_;
-        dispatchLocked(RelayEvent::message(shared_from_this(), std::move(frame)));
+        dispatchLocked(std::move(event));
     }
 }
 
@@ -203,15 +229,15 @@ bool RelayConnection::flushLocked(Released& released) {
     return true;
 }
 
-void RelayConnection::updateInterestLocked() {
+void RelayConnection::updateInterestLocked(bool rearm) {
     if (closed_ || token_ == 0) return;
     uint32_t wanted = 0;
     if (queued_ < options_.limits.maxQueuedRequests &&
         pendingOutputLocked() <= options_.limits.outputHighWater)
         wanted |= EPOLLIN;
     if (pendingOutputLocked() > 0) wanted |= EPOLLOUT;
-    if (wanted == interest_) return;
-    if (poller_->modify(socket_.get(), token_, wanted) == 0) interest_ = wanted;
+    if (wanted == interest_ && !rearm) return;
+    if (poller_->modify(socket_.get(), token_, wanted | EPOLLONESHOT) == 0) interest_ = wanted;
 }
 
 void RelayConnection::chargeLocked(Released& released) {

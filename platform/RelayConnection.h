@@ -5,6 +5,10 @@
 // time and in the order the peer sent them. The queue runs over the shared
 // pool (through the listener's queue), so different peers are served in
 // parallel and a peer whose handler blocks delays only itself. When the
+// queue is idle and the poller has a place for inline work, the I/O thread
+// that read a request runs it itself, as the queue's own item (claimed, so
+// later events of the peer wait for it): the same order and the same one at
+// a time, without a hop to another thread. When the
 // connection ends - the peer hung up, broke the protocol, flooded it, or
 // the connection was cancelled - the handler gets one last event,
 // ConnectionInvalid, after every event delivered before; then the
@@ -203,14 +207,24 @@ class RelayConnection final : public RelayPoller::Watcher,
     };
 
     size_t pendingOutputLocked() const { return output_.size() - outputStart_; }
-    // Reads one chunk and hands over the requests it completes.
-    void readLocked(Released& released);
-    // Turns buffered frames into events while the queue has room.
-    void pumpLocked(Released& released);
+    // Reads one chunk and hands over the requests it completes; the first
+    // may be left in `runHere` to be run inline (see pumpLocked).
+    void readLocked(Released& released, std::optional<RelayEvent>* runHere);
+    // Turns buffered frames into events while the queue has room. With
+    // `runHere`, the first event goes there instead of the queue when it may
+    // run inline: nothing else of the peer is queued or running, the poller
+    // has a place for it and the queue could be claimed.
+    void pumpLocked(Released& released, std::optional<RelayEvent>* runHere = nullptr);
+    bool claimInlineLocked();
+    // Runs an event pumpLocked() left for inline running, then gives back
+    // the claim and the poller's place.
+    void runInline(const RelayEvent& event);
     // Writes what the socket takes; false (connection closed) on an error.
     bool flushLocked(Released& released);
-    // Waits for exactly the readiness the connection can use now.
-    void updateInterestLocked();
+    // Waits for exactly the readiness the connection can use now. The
+    // registration is one-shot: `rearm` renews it after a readiness was
+    // handled, even when the interest is unchanged.
+    void updateInterestLocked(bool rearm = false);
     // Ends the connection. The poller's reference goes to `released`, to be
     // dropped once the lock is let go.
     void closeLocked(int level, const std::string& reason, Released& released);

@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <thread>
 
 namespace berth {
 namespace {
@@ -19,7 +20,7 @@ constexpr int kAcceptsPerReadiness = 64;
 
 }  // namespace
 
-// Accepts on the poller's thread and owns what the listener shares with it.
+// Accepts on the poller's threads and owns what the listener shares with it.
 class RelayListener::Acceptor final : public RelayPoller::Watcher {
   public:
     Acceptor(UniqueFd socket, std::shared_ptr<WorkQueue> queue, Options options,
@@ -169,8 +170,9 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
 std::unique_ptr<RelayListener> RelayListener::make(UniqueFd socket,
                                                    std::shared_ptr<WorkQueue> queue,
                                                    Options options, std::string* why) {
-    std::shared_ptr<RelayPoller> poller =
-        RelayPoller::start(options.label.substr(0, 11) + ".io", why);
+    std::shared_ptr<RelayPoller> poller = RelayPoller::start(
+        options.label.substr(0, 11) + ".io",
+        options.ioThreads ? options.ioThreads : std::thread::hardware_concurrency() + 1, why);
     if (!poller) return nullptr;
     auto acceptor =
         std::make_shared<Acceptor>(std::move(socket), std::move(queue), std::move(options), poller);

@@ -12,10 +12,11 @@
 // own serial queue runs on that queue too, so with a concurrent listener
 // queue different peers are served in parallel.
 //
-// Accepting never waits on a peer: one I/O thread accepts and serves the
-// sockets of all connections, non-blocking, whatever their number; a peer's
-// credentials, pidfd and executable are taken at accept (see RelayPeer) and
-// its signing identity is left for the requests to evaluate.
+// Accepting never waits on a peer: a few I/O threads accept and serve the
+// sockets of all connections, non-blocking, whatever their number, and run
+// requests themselves while one of them is left waiting (see RelayPoller); a
+// peer's credentials, pidfd and executable are taken at accept (see
+// RelayPeer) and its signing identity is left for the requests to evaluate.
 #pragma once
 
 #include <cstddef>
@@ -45,6 +46,8 @@ class RelayListener {
         // root's signature registry.
         std::shared_ptr<CodeSigningService> codeSigning;
         RelayLimits limits;
+        // I/O threads; 0: one more than the processors the process may use.
+        size_t ioThreads = 0;
         // What one user other than root may hold; see RelayUserBudget.
         RelayUserLimits userLimits;
         RelayLog log;

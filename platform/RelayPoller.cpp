@@ -3,6 +3,7 @@
 #include <pthread.h>
 #include <sys/eventfd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -15,7 +16,8 @@ constexpr int kEventsPerWait = 64;
 
 }  // namespace
 
-std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, std::string* why) {
+std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, size_t threads,
+                                                std::string* why) {
     auto poller = std::make_shared<RelayPoller>(Passkey{});
     poller->epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
     poller->wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
@@ -27,25 +29,49 @@ std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, s
         if (why) *why = std::string("cannot set up the relay's epoll loop: ") + strerror(errno);
         return nullptr;
     }
-    // The thread holds the poller until it ends, so a watcher that drops
+    threads = std::max<size_t>(threads, 1);
+    poller->inlinePlaces_ = threads - 1;
+    // Each thread holds the poller until it ends, so a watcher that drops
     // the last other reference from inside ready() cannot free the loop
-    // under its feet.
-    poller->thread_ = std::thread([self = poller, name = threadName.substr(0, 15)] {
-        ::pthread_setname_np(::pthread_self(), name.c_str());
-        self->run();
-    });
+    // under its feet. No thread runs before all are in the vector.
+    std::lock_guard join(poller->joinMutex_);
+    for (size_t i = 0; i < threads; ++i)
+        poller->threads_.emplace_back([self = poller, name = threadName.substr(0, 15)] {
+            ::pthread_setname_np(::pthread_self(), name.c_str());
+            { std::lock_guard started(self->joinMutex_); }
+            self->run();
+        });
     return poller;
 }
 
 RelayPoller::~RelayPoller() {
-    // Only reached once the thread has left run(): it holds a reference
+    // Only reached once every thread has left run(): each holds a reference
     // while it runs.
-    if (thread_.joinable()) {
-        if (isPollerThread())
-            thread_.detach();
+    for (std::thread& thread : threads_) {
+        if (!thread.joinable()) continue;
+        if (thread.get_id() == std::this_thread::get_id())
+            thread.detach();
         else
-            thread_.join();
+            thread.join();
     }
+}
+
+bool RelayPoller::isPollerThread() const {
+    const std::thread::id self = std::this_thread::get_id();
+    return std::any_of(threads_.begin(), threads_.end(),
+                       [self](const std::thread& thread) { return thread.get_id() == self; });
+}
+
+bool RelayPoller::reserveInline() {
+    size_t free = inlinePlaces_.load(std::memory_order_relaxed);
+    while (free > 0)
+        if (inlinePlaces_.compare_exchange_weak(free, free - 1, std::memory_order_acquire))
+            return true;
+    return false;
+}
+
+void RelayPoller::releaseInline() {
+    inlinePlaces_.fetch_add(1, std::memory_order_release);
 }
 
 uint64_t RelayPoller::add(int fd, uint32_t events, std::shared_ptr<Watcher> watcher) {
@@ -86,13 +112,18 @@ void RelayPoller::stop() {
         }
     }
     std::lock_guard join(joinMutex_);
-    if (thread_.joinable() && !isPollerThread()) thread_.join();
+    for (std::thread& thread : threads_)
+        if (thread.joinable() && thread.get_id() != std::this_thread::get_id()) thread.join();
 }
 
 void RelayPoller::run() {
     epoll_event events[kEventsPerWait];
+    // With several threads, each takes one event at a time: a thread that
+    // goes on to run a request inline must not hold back events it collected
+    // for other peers.
+    const int perWait = threads_.size() > 1 ? 1 : kEventsPerWait;
     for (;;) {
-        const int count = ::epoll_wait(epoll_.get(), events, kEventsPerWait, -1);
+        const int count = ::epoll_wait(epoll_.get(), events, perWait, -1);
         if (count < 0 && errno != EINTR) return;
         for (int i = 0; i < count; ++i) {
             std::shared_ptr<Watcher> watcher;

@@ -1,21 +1,29 @@
-// The I/O thread of the relay: one epoll loop that waits on the listening
-// socket and every peer socket of a listener, and tells each watcher when
-// its descriptor is ready.
+// The I/O threads of the relay: one epoll set holding the listening socket
+// and every peer socket of a listener, waited on by a few threads, each of
+// which tells a watcher when its descriptor is ready.
 //
-// One thread serves any number of peers, because nothing it does can block:
-// every socket is non-blocking, frames are decoded as their bytes arrive, and
-// request handling runs elsewhere (on the peers' queues). Watchers are
-// called on the poller's thread, one at a time.
+// Any number of peers are served by a few threads because nothing a thread
+// does for a socket blocks: every socket is non-blocking and frames are
+// decoded as their bytes arrive. A watcher registered one-shot
+// (EPOLLONESHOT) is told by one thread at a time and re-arms itself with
+// modify(); others may be told by several threads at once.
+//
+// A request may run on the thread that read it, sparing a hop to another
+// thread, but only while another thread is left waiting: at most all threads
+// but one run such inline work at a time (reserveInline), so a request that
+// blocks never stops the reading of other peers.
 #pragma once
 
 #include <sys/epoll.h>
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/UniqueFd.h"
 
@@ -35,8 +43,9 @@ class RelayPoller {
         virtual void ready(uint32_t events) = 0;
     };
 
-    // A poller with its thread running, or null with the reason.
-    static std::shared_ptr<RelayPoller> start(const std::string& threadName,
+    // A poller with `threads` threads running (at least one), or null with
+    // the reason.
+    static std::shared_ptr<RelayPoller> start(const std::string& threadName, size_t threads = 1,
                                               std::string* why = nullptr);
 
     ~RelayPoller();
@@ -56,21 +65,28 @@ class RelayPoller {
     // notification already collected for the registration is not delivered.
     std::shared_ptr<Watcher> remove(int fd, uint64_t token);
 
-    // Ends the thread after the watcher call under way, if any; waits for it
-    // unless called on the poller's own thread. Registrations stay until
-    // removed but are never notified again. The thread keeps the poller
-    // alive until it has ended, so whoever starts a poller must stop it.
+    // Ends the threads after the watcher calls under way, if any; waits for
+    // them except for the calling thread when it is one of them.
+    // Registrations stay until removed but are never notified again. Each
+    // thread keeps the poller alive until it has ended, so whoever starts a
+    // poller must stop it.
     void stop();
 
-    bool isPollerThread() const { return std::this_thread::get_id() == thread_.get_id(); }
+    bool isPollerThread() const;
+
+    // Takes one of the places for inline work (all threads but one); false
+    // when none is free. Each place taken is given back by releaseInline().
+    bool reserveInline();
+    void releaseInline();
 
   private:
     void run();
 
     UniqueFd epoll_;
-    UniqueFd wake_;  // eventfd that ends the thread
+    UniqueFd wake_;  // eventfd that ends the threads
     std::mutex joinMutex_;
-    std::thread thread_;
+    std::vector<std::thread> threads_;  // set by start(), then only joined
+    std::atomic<size_t> inlinePlaces_{0};
     std::mutex mutex_;
     std::unordered_map<uint64_t, std::shared_ptr<Watcher>> watchers_;
     uint64_t nextToken_ = 1;

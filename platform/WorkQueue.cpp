@@ -330,19 +330,30 @@ void WorkQueue::checkSyncWouldFinish() const {
     }
 }
 
-bool WorkQueue::trySyncInline(void (*call)(void*), void* context) {
-    if (kind_ != Kind::serial || global_ || executor_) return false;
-    {
-        std::lock_guard lock(mutex_);
-        // Background work keeps its lower priority on its own threads.
-        if (suspendCount_ > 0 || draining_ || !pending_.empty() ||
-            target_ != global(QueuePriority::normal))
+bool WorkQueue::targetsAllowClaim() const {
+    // Background work keeps its lower priority on its own threads.
+    const std::shared_ptr<WorkQueue>& normal = global(QueuePriority::normal);
+    for (std::shared_ptr<WorkQueue> queue = target(); queue != normal;) {
+        if (!queue || queue->kind_ != Kind::concurrent || queue->global_ || queue->executor_)
             return false;
-        // Claimed as a drain would be: items submitted meanwhile wait.
-        draining_ = true;
+        std::lock_guard lock(queue->mutex_);
+        if (queue->suspendCount_ > 0) return false;
+        queue = queue->target_;
     }
-    // Lets go of the queue, scheduling what arrived while `call` ran, even
-    // when it throws.
+    return true;
+}
+
+bool WorkQueue::tryClaim() {
+    if (kind_ != Kind::serial || global_ || executor_ || !targetsAllowClaim()) return false;
+    std::lock_guard lock(mutex_);
+    if (suspendCount_ > 0 || draining_ || !pending_.empty()) return false;
+    // Claimed as a drain would be: items submitted meanwhile wait.
+    draining_ = true;
+    return true;
+}
+
+void WorkQueue::runClaimed(const std::function<void()>& work) {
+    // Ends the claim, scheduling what arrived meanwhile, even on a throw.
     struct Release {
         WorkQueue* queue;
         ~Release() {
@@ -351,15 +362,28 @@ bool WorkQueue::trySyncInline(void (*call)(void*), void* context) {
             queue->schedule(std::move(lock));
         }
     } release{this};
-    RunningFrame frame(this);
-    call(context);
-    return true;
+    // Running as the queue's item would: as work of each target, outermost
+    // first.
+    std::vector<const WorkQueue*> chain{this};
+    for (auto queue = target(); queue; queue = queue->target()) chain.push_back(queue.get());
+    auto& running = tlsContext.running;
+    const size_t depth = running.size();
+    running.insert(running.end(), chain.rbegin(), chain.rend());
+    struct Unwind {
+        std::vector<const WorkQueue*>& running;
+        size_t depth;
+        ~Unwind() { running.resize(depth); }
+    } unwind{running, depth};
+    work();
 }
 
 void WorkQueue::syncInvoke(void (*call)(void*), void* context) {
     checkSyncWouldFinish();
     const auto self = shared_from_this();
-    if (trySyncInline(call, context)) return;
+    if (tryClaim()) {
+        runClaimed([&] { call(context); });
+        return;
+    }
     SyncWait wait;
     async(SyncItem(&wait, call, context, &tlsContext));
     wait.await();

@@ -29,6 +29,13 @@
 // message naming the queue, instead of hanging it. The same holds for a sync
 // made from inside a sync item on behalf of its waiting caller.
 //
+// Running on the caller. A thread may claim an idle serial queue (nothing
+// pending, running or suspending it, on the normal priority) and run work as
+// the queue's own, on itself: nothing else of the queue runs meanwhile, and
+// work submitted meanwhile waits for the claim to end, in order. A sync onto
+// such a queue does this by itself, and the message service runs a request
+// on the thread that read it this way, sparing both a thread hop.
+//
 // Lifetime. A queue lives as long as its last holder, and work that is
 // waiting to run holds its queue: dropping every handle of a queue that has
 // pending items still runs them all, in order, and then frees the queue. Only
@@ -47,6 +54,7 @@
 #include <cstddef>
 #include <deque>
 #include <exception>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -109,6 +117,17 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
     template <class F>
     std::invoke_result_t<F&> sync(F&& fn);
 
+    // Claims this queue for the calling thread when it is a serial queue
+    // with nothing pending, running or suspended, over concurrent queues
+    // that are not suspended and end at the normal global queue. False, and
+    // nothing claimed, otherwise. A claim must be ended by runClaimed().
+    bool tryClaim();
+    // Runs `work` on the calling thread as this queue's item (isCurrent() is
+    // true for it and its targets meanwhile), then ends the claim taken by
+    // tryClaim() and schedules what was submitted meanwhile, also when
+    // `work` throws.
+    void runClaimed(const std::function<void()>& work);
+
     void suspend();
     void resume();
 
@@ -118,11 +137,9 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
   private:
     // Entry point of a type-erased synchronous call.
     void syncInvoke(void (*call)(void*), void* context);
-    // Runs `call` on the calling thread when the queue is a serial queue
-    // over the normal global queue with nothing pending, running or suspending it;
-    // false (nothing run) otherwise.
-    bool trySyncInline(void (*call)(void*), void* context);
     void checkSyncWouldFinish() const;
+    // Whether every queue this one targets lets a claimed item run now.
+    bool targetsAllowClaim() const;
 
     // Hands the work that pending items need (a drain, or runners) to the
     // target, unless suspended. Releases `lock`.

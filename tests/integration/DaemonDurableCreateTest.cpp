@@ -29,6 +29,9 @@
 #include <sys/ioctl.h>
 #include <sys/mount.h>
 
+#include <chrono>
+#include <thread>
+
 #include "BTHPropertyListFile.h"
 #include "DaemonSupport.h"
 #include "core/BTHContainerClass.h"
@@ -88,8 +91,14 @@ class PowerCutVolume {
     // Unmounts the dead file system and mounts the image again, replaying
     // its journal as the next boot would.
     std::string remount() {
-        if (::umount2(deviceRoot().c_str(), 0) != 0)
-            return std::string("umount failed: ") + strerror(errno);
+        // A dead daemon's ring of batched syncs is torn down by the kernel
+        // after the process is gone, and holds the files it was syncing (so
+        // the mount) until then: busy for a moment, not for good.
+        for (int attempt = 0; ::umount2(deviceRoot().c_str(), 0) != 0; ++attempt) {
+            if (errno != EBUSY || attempt == 100)
+                return std::string("umount failed: ") + strerror(errno);
+            std::this_thread::sleep_for(std::chrono::milliseconds(50));
+        }
         mounted_ = false;
         return attach();
     }
