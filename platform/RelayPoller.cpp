@@ -34,11 +34,11 @@ std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, s
     // Each thread holds the poller until it ends, so a watcher that drops
     // the last other reference from inside ready() cannot free the loop
     // under its feet. No thread runs before all are in the vector.
-    std::lock_guard join(poller->joinMutex_);
+    std::unique_lock starting(poller->startMutex_);
     for (size_t i = 0; i < threads; ++i)
         poller->threads_.emplace_back([self = poller, name = threadName.substr(0, 15)] {
             ::pthread_setname_np(::pthread_self(), name.c_str());
-            { std::lock_guard started(self->joinMutex_); }
+            { std::lock_guard started(self->startMutex_); }
             self->run();
         });
     return poller;

@@ -83,7 +83,8 @@ class RelayPoller {
     void run();
 
     UniqueFd epoll_;
-    UniqueFd wake_;  // eventfd that ends the threads
+    UniqueFd wake_;          // eventfd that ends the threads
+    std::mutex startMutex_;  // held by start() until every thread is in threads_
     std::mutex joinMutex_;
     std::vector<std::thread> threads_;  // set by start(), then only joined
     std::atomic<size_t> inlinePlaces_{0};

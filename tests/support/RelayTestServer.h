@@ -18,10 +18,11 @@ class RelayTestServer {
     using Handler = std::function<void(const RelayEvent&, RelayReply&)>;
 
     // Peers are identified by `signing`, by default the scratch device
-    // root's registry (which signs nothing).
+    // root's registry (which signs nothing). `ioThreads` 0: the listener's
+    // default.
     explicit RelayTestServer(Handler handler, RelayLimits limits = {},
                              std::shared_ptr<CodeSigningService> signing = nullptr,
-                             RelayUserLimits userLimits = {})
+                             RelayUserLimits userLimits = {}, size_t ioThreads = 0)
         : state_(std::make_shared<State>()) {
         state_->handler = std::move(handler);
         std::string why;
@@ -36,6 +37,7 @@ class RelayTestServer {
         options.label = "relay.test";
         options.limits = limits;
         options.userLimits = userLimits;
+        options.ioThreads = ioThreads;
         options.codeSigning = std::move(signing);
         options.log = [state = state_](int level, const std::string& line) {
             std::lock_guard lock(state->mutex);

@@ -117,6 +117,56 @@ TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
     EXPECT_TRUE(slowReply.get());
 }
 
+// Requests run on the I/O thread that read them only while another thread is
+// left to read: with two I/O threads, blocked handlers of three peers (one
+// run where it was read, the others on their queues) leave the fourth peer
+// served.
+TEST(RelayTest, HandlersBlockingWhereTheyWereReadNeverStopTheReading) {
+    constexpr uint64_t kBlocked = 3;
+    std::mutex mutex;
+    std::condition_variable changed;
+    uint64_t blocked = 0;
+    bool released = false;
+    RelayTestServer server(
+        [&](const RelayEvent& event, RelayReply& reply) {
+            if (event.message().find("Block")) {
+                std::unique_lock lock(mutex);
+                ++blocked;
+                changed.notify_all();
+                changed.wait(lock, [&] { return released; });
+            }
+            reply.body().set("Seq", numberAt(event.message(), "Seq"));
+        },
+        RelayLimits{}, nullptr, RelayUserLimits{}, /*ioThreads=*/2);
+    std::vector<std::unique_ptr<BerthConnection>> slow;
+    std::vector<std::future<std::optional<Value>>> slowReplies;
+    for (uint64_t i = 0; i < kBlocked; ++i) {
+        slow.push_back(connectTo(server));
+        ASSERT_TRUE(slow.back());
+        slowReplies.push_back(std::async(std::launch::async, [&connection = *slow.back()] {
+            return connection.request(dict({{"Block", true}}), 60s);
+        }));
+    }
+    {
+        std::unique_lock lock(mutex);
+        ASSERT_TRUE(changed.wait_for(lock, 30s, [&] { return blocked == kBlocked; }));
+    }
+    auto fast = connectTo(server);
+    ASSERT_TRUE(fast);
+    for (uint64_t seq = 0; seq < 20; ++seq) {
+        BerthError error;
+        auto reply = fast->request(dict({{"Seq", seq}}), 10s, &error);
+        ASSERT_TRUE(reply) << error.message;
+        EXPECT_EQ(numberAt(*reply, "Seq"), seq);
+    }
+    {
+        std::lock_guard lock(mutex);
+        released = true;
+        changed.notify_all();
+    }
+    for (auto& reply : slowReplies) EXPECT_TRUE(reply.get());
+}
+
 TEST(RelayTest, APeerThatLeavesBeforeItsReplyCostsNothingButThatReply) {
     test::Event release, blocking;
     RelayTestServer server([&](const RelayEvent& event, RelayReply&) {
