@@ -16,25 +16,32 @@ bool BTHClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
     BTH_FUNCTION(
         "-[BTHClientConnection _moveItemAtURLToDeathRow:isDir:startDeletionThread:error:]");
     BTHFileManager& fileManager = BTHFileManager::defaultManager();
+    // Emptying death row destroys every slot it lists, a slot made here for
+    // a move that has not happened yet included: the move then finds no
+    // destination and takes a new slot. Only a missing item is already gone.
+    constexpr int kSlotAttempts = 8;
     BTHErrorRef moveError;
-    const std::optional<BTHFileURL> slot = fileManager.createTemporaryDirectoryInDirectoryURL(
-        BTHGlobalConfiguration::sharedInstance().deathrowDirectory(), &moveError);
-    if (!slot) {
-        BTHSetError(error, BTHMakeError(BTHErrorMoveToDeathRowFailed, moveError,
-                                        "Failed to create unique directory at: %@", url));
-        return false;
-    }
-    const BTHFileURL destination{slot->path / url.filename(), isDir};
-    if (!fileManager.moveItemAtURL(url, destination.path, &moveError)) {
+    for (int attempt = 0; attempt < kSlotAttempts; ++attempt) {
+        const std::optional<BTHFileURL> slot = fileManager.createTemporaryDirectoryInDirectoryURL(
+            BTHGlobalConfiguration::sharedInstance().deathrowDirectory(), &moveError);
+        if (!slot) {
+            BTHSetError(error, BTHMakeError(BTHErrorMoveToDeathRowFailed, moveError,
+                                            "Failed to create unique directory at: %@", url));
+            return false;
+        }
+        const BTHFileURL destination{slot->path / url.filename(), isDir};
+        if (fileManager.moveItemAtURL(url, destination.path, &moveError)) {
+            if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+            return true;
+        }
+        if (!moveError || !moveError->isPOSIXError(ENOENT)) break;
         // Already gone: nothing to destroy; the empty slot goes with the next
         // emptying.
-        if (moveError && moveError->isPOSIXError(ENOENT)) return true;
-        BTHSetError(error, BTHMakeError(BTHErrorMoveToDeathRowFailed, moveError,
-                                        "Failed to move item at: %@ to: %@", url, destination));
-        return false;
+        if (fileManager.itemDoesNotExistAtURL(url)) return true;
     }
-    if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
-    return true;
+    BTHSetError(error, BTHMakeError(BTHErrorMoveToDeathRowFailed, moveError,
+                                    "Failed to move item at: %@ to death row", url));
+    return false;
 }
 
 void BTHClientConnection::deleteContainersOnDeathRowWithCompletion(

@@ -7,6 +7,7 @@
 #include "BTHContainerCache.h"
 #include "BTHDataProtectionChangeOperation.h"
 #include "BTHError.h"
+#include "BTHLocks.h"
 #include "BTHLog.h"
 #include "core/BTHContainerClass.h"
 
@@ -97,8 +98,14 @@ void BTHDataProtectionManager::setDataProtectionOnDataContainerForUser(
                                 identifier, containerClass);
         }
         // A snapshot: the pass compares the container's place then with
-        // its place when it runs.
-        const auto container = std::make_shared<const BTHMetadata>(*found);
+        // its place when it runs. The cached record is changed in place
+        // under its identifier lock (a finished change records its class in
+        // the info), so it is copied under that lock.
+        std::shared_ptr<const BTHMetadata> container;
+        {
+            BTHIdentifierLockGuard lock(found->uuid().string(), false);
+            container = std::make_shared<const BTHMetadata>(*found);
+        }
         const int32_t currentClass = currentClassOf(*container);
         if (dataProtectionClass == currentClass) return BTHErrorRef();
         if (dataProtectionClass == 2)

@@ -1,6 +1,8 @@
 // A relay server for the relay's test programs: a checked-in socket in a
 // scratch directory, a listener on a concurrent queue, and a per-request
-// handler supplied by the test. Records what the connections went through.
+// handler supplied by the test (or a processor that takes every event and
+// replies itself, as the daemon's request processing does). Records what the
+// connections went through.
 #pragma once
 
 #include <cstring>
@@ -25,42 +27,20 @@ class RelayTestServer {
                              RelayUserLimits userLimits = {}, size_t ioThreads = 0)
         : state_(std::make_shared<State>()) {
         state_->handler = std::move(handler);
-        std::string why;
-        auto checkIn = ServiceCheckIn::claim("relay.test", SOCK_STREAM, 0666, nullptr, &why,
-                                             directory_.path());
-        if (!checkIn) {
-            ADD_FAILURE() << why;
-            return;
-        }
-        path_ = checkIn->path();
-        RelayListener::Options options;
-        options.label = "relay.test";
-        options.limits = limits;
-        options.userLimits = userLimits;
-        options.ioThreads = ioThreads;
-        options.codeSigning = std::move(signing);
-        options.log = [state = state_](int level, const std::string& line) {
-            std::lock_guard lock(state->mutex);
-            state->log.push_back(std::to_string(level) + " " + line);
-        };
-        listener_ = RelayListener::make(checkIn->takeSocket(),
-                                        WorkQueue::makeConcurrent("relay.test.listener"),
-                                        std::move(options), &why);
-        checkIn_.emplace(std::move(*checkIn));
-        if (!listener_) {
-            ADD_FAILURE() << why;
-            return;
-        }
-        // The connections' last events may come after the server is gone:
-        // they hold on to the state, not to the server.
-        listener_->setEventHandler(
-            [state = state_](const std::shared_ptr<RelayConnection>& connection) {
-                connection->setEventHandler([state, connection](const RelayEvent& event) {
-                    onEvent(*state, connection, event);
-                });
-                connection->resume();
-            });
-        listener_->resume();
+        start(limits, std::move(signing), userLimits, ioThreads);
+    }
+
+    // Takes every event of every connection, the connection's end included,
+    // and makes and sends the replies itself.
+    using Processor = std::function<void(const RelayEvent&)>;
+    struct ProcessEvents {
+        Processor processor;
+    };
+    RelayTestServer(ProcessEvents process, std::shared_ptr<CodeSigningService> signing,
+                    RelayLimits limits = {}, RelayUserLimits userLimits = {})
+        : state_(std::make_shared<State>()) {
+        state_->processor = std::move(process.processor);
+        start(limits, std::move(signing), userLimits);
     }
 
     ~RelayTestServer() { listener_.reset(); }
@@ -103,18 +83,61 @@ class RelayTestServer {
   private:
     struct State {
         Handler handler;
+        Processor processor;
         std::mutex mutex;  // guards the log
         std::atomic<size_t> invalidated = 0;
         std::atomic<size_t> unsent = 0;
         std::vector<std::string> log;
     };
 
-    static void onEvent(State& state, const std::shared_ptr<RelayConnection>& connection,
-                        const RelayEvent& event) {
-        if (event.isConnectionInvalid()) {
-            ++state.invalidated;
+    void start(RelayLimits limits, std::shared_ptr<CodeSigningService> signing,
+               RelayUserLimits userLimits, size_t ioThreads = 0) {
+        std::string why;
+        auto checkIn = ServiceCheckIn::claim("relay.test", SOCK_STREAM, 0666, nullptr, &why,
+                                             directory_.path());
+        if (!checkIn) {
+            ADD_FAILURE() << why;
             return;
         }
+        path_ = checkIn->path();
+        RelayListener::Options options;
+        options.label = "relay.test";
+        options.limits = limits;
+        options.userLimits = userLimits;
+        options.ioThreads = ioThreads;
+        options.codeSigning = std::move(signing);
+        options.log = [state = state_](int level, const std::string& line) {
+            std::lock_guard lock(state->mutex);
+            state->log.push_back(std::to_string(level) + " " + line);
+        };
+        listener_ = RelayListener::make(checkIn->takeSocket(),
+                                        WorkQueue::makeConcurrent("relay.test.listener"),
+                                        std::move(options), &why);
+        checkIn_.emplace(std::move(*checkIn));
+        if (!listener_) {
+            ADD_FAILURE() << why;
+            return;
+        }
+        // The connections' last events may come after the server is gone:
+        // they hold on to the state, not to the server.
+        listener_->setEventHandler(
+            [state = state_](const std::shared_ptr<RelayConnection>& connection) {
+                connection->setEventHandler([state, connection](const RelayEvent& event) {
+                    onEvent(*state, connection, event);
+                });
+                connection->resume();
+            });
+        listener_->resume();
+    }
+
+    static void onEvent(State& state, const std::shared_ptr<RelayConnection>& connection,
+                        const RelayEvent& event) {
+        if (event.isConnectionInvalid()) ++state.invalidated;
+        if (state.processor) {
+            state.processor(event);
+            return;
+        }
+        if (event.isConnectionInvalid()) return;
         std::optional<RelayReply> reply = event.makeReply();
         if (!reply) {
             connection->cancel();
@@ -149,24 +172,41 @@ inline bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
     return true;
 }
 
+// The frames arriving on a blocking socket, one after another: bytes read
+// past a frame stay for the next, so nothing that arrived is overlooked.
+class FrameReader {
+  public:
+    explicit FrameReader(int fd) : fd_(fd) {}
+
+    // The next frame; none when the stream ends, breaks or is not frames.
+    std::optional<relay::Frame> next() {
+        uint8_t chunk[4096];
+        for (;;) {
+            relay::Frame frame;
+            const auto status = decoder_.next(frame);
+            if (status == relay::FrameDecoder::Status::Frame) return frame;
+            if (status == relay::FrameDecoder::Status::Error) return std::nullopt;
+            const ssize_t got = ::read(fd_, chunk, sizeof chunk);
+            if (got < 0 && errno == EINTR) continue;
+            if (got <= 0) return std::nullopt;
+            decoder_.feed(std::span<const uint8_t>(chunk, static_cast<size_t>(got)));
+        }
+    }
+
+  private:
+    int fd_;
+    relay::FrameDecoder decoder_;
+};
+
 // Reads frames from a blocking socket until `count` arrived, or the stream
 // ends or breaks.
 inline std::vector<relay::Frame> readFrames(int fd, size_t count) {
-    relay::FrameDecoder decoder;
+    FrameReader reader(fd);
     std::vector<relay::Frame> frames;
-    uint8_t chunk[4096];
     while (frames.size() < count) {
-        relay::Frame frame;
-        auto status = decoder.next(frame);
-        if (status == relay::FrameDecoder::Status::Frame) {
-            frames.push_back(std::move(frame));
-            continue;
-        }
-        if (status == relay::FrameDecoder::Status::Error) break;
-        const ssize_t got = ::read(fd, chunk, sizeof chunk);
-        if (got < 0 && errno == EINTR) continue;
-        if (got <= 0) break;
-        decoder.feed(std::span<const uint8_t>(chunk, static_cast<size_t>(got)));
+        std::optional<relay::Frame> frame = reader.next();
+        if (!frame) break;
+        frames.push_back(std::move(*frame));
     }
     return frames;
 }
