@@ -21,6 +21,7 @@ bool BTHClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
     // destination and takes a new slot. Only a missing item is already gone.
     constexpr int kSlotAttempts = 8;
     BTHErrorRef moveError;
+    std::filesystem::path tried;  // the last destination, for the error
     for (int attempt = 0; attempt < kSlotAttempts; ++attempt) {
         const std::optional<BTHFileURL> slot = fileManager.createTemporaryDirectoryInDirectoryURL(
             BTHGlobalConfiguration::sharedInstance().deathrowDirectory(), &moveError);
@@ -30,6 +31,7 @@ bool BTHClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
             return false;
         }
         const BTHFileURL destination{slot->path / url.filename(), isDir};
+        tried = destination.path;
         if (fileManager.moveItemAtURL(url, destination.path, &moveError)) {
             if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
             return true;
@@ -40,7 +42,7 @@ bool BTHClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
         if (fileManager.itemDoesNotExistAtURL(url)) return true;
     }
     BTHSetError(error, BTHMakeError(BTHErrorMoveToDeathRowFailed, moveError,
-                                    "Failed to move item at: %@ to death row", url));
+                                    "Failed to move item at: %@ to: %@", url, tried));
     return false;
 }
 
