@@ -1,5 +1,8 @@
 #include "MaintenanceCommands.h"
 
+#include <sys/socket.h>
+#include <sys/types.h>
+
 #include <ostream>
 #include <thread>
 
@@ -43,21 +46,37 @@ int migrate(const MaintenanceOptions& options, std::ostream& out, std::ostream& 
     return kExitSuccess;
 }
 
+// The daemon process at the other end of `connection` (the one listening
+// when it connected); 0 when the kernel does not say.
+pid_t daemonProcessOf(const BerthConnection& connection) {
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (::getsockopt(connection.socket(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
+        return 0;
+    return credentials.pid;
+}
+
 // Repeats the request on a fresh connection after each exit of the daemon;
-// a round that neither succeeds nor ends the connection is a failure.
+// a round that neither succeeds nor ends the connection is a failure. An
+// exit is counted once per daemon process: a reconnect can still reach the
+// listening socket of the daemon that is exiting, whose closing then ends
+// that connection too.
 int retryTest(const MaintenanceOptions& options, std::ostream& out, std::ostream& err) {
     uint64_t exits = 0;
+    pid_t exited = 0;
     for (;;) {
         BerthError error;
         const std::unique_ptr<BerthConnection> connection = reconnect(options, &error);
         if (!connection) return fail(ContainerError{0, "", error.message, error}, err);
+        const pid_t daemon = daemonProcessOf(*connection);
         ContainerError failure;
         if (BerthMaintenance(*connection, options.timeout)
                 .retryTest(options.user, options.crashes, &failure))
             break;
         if (failure.isReplyError() || failure.transport.code != BerthError::Code::ConnectionClosed)
             return fail(failure, err);
-        ++exits;
+        if (daemon == 0 || daemon != exited) ++exits;
+        exited = daemon;
     }
     if (options.json) {
         Value result = Value::dictionary();
