@@ -41,10 +41,7 @@ std::string servedIdentifier(const Value& message, const BTHPeerIdentity& peer) 
 void refreshCallerRegisteredEntitlements(const std::string& identifier, const Value& entitlements) {
     BTH_FUNCTION("checkEntitlementsAndInitClientObject");
     BTHCodeSigningMapping* mapping = BTHCodeSigningMapping::sharedInstance();
-    if (!mapping) return;
-    if (!mapping->identifierHasCallerRegisteredEntitlements(identifier) &&
-        mapping->codeSigningInfoExistForIdentifier(identifier))
-        return;
+    if (!mapping || mapping->callerEntitlementsNeedNoProcessing(entitlements, identifier)) return;
     const uint64_t code = mapping->processCallerRegisteredEntitlements(entitlements, identifier);
     if (code != BTHErrorSuccess)
         BTHLogError("Error processing entitlements for %@ : %llu", identifier, code);

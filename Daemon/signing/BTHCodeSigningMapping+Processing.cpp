@@ -34,13 +34,34 @@ uint64_t BTHCodeSigningMapping::processCodeSigningInfo(const std::optional<Value
     return lockingAll([&] { return onQueueProcessCodeSigningInfo(info, identifier, options); });
 }
 
-uint64_t BTHCodeSigningMapping::processCallerRegisteredEntitlements(const Value& entitlements,
-                                                                    const std::string& identifier) {
+namespace {
+
+// A caller's entitlements as code-signing information, and its options.
+std::pair<Value, Value> callerRegisteredInfo(const Value& entitlements) {
     Value info = Value::dictionary();
     info.set(kBTHEntitlementsKey, entitlements);
     Value options = Value::dictionary();
     options.set(kBTHRegByCallerOption, true);
+    return {std::move(info), std::move(options)};
+}
+
+}  // namespace
+
+uint64_t BTHCodeSigningMapping::processCallerRegisteredEntitlements(const Value& entitlements,
+                                                                    const std::string& identifier) {
+    auto [info, options] = callerRegisteredInfo(entitlements);
     return processCodeSigningInfo(info, identifier, options);
+}
+
+bool BTHCodeSigningMapping::callerEntitlementsNeedNoProcessing(const Value& entitlements,
+                                                               const std::string& identifier) {
+    return onCodeSignQueue([&] {
+        const BTHCodeSigningEntry* entry = storedEntry(identifier);
+        if (!(entry && entry->isRegisteredByCaller()))
+            return onQueueCodeSigningInfoForIdentifier(identifier, false).has_value();
+        auto [info, options] = callerRegisteredInfo(entitlements);
+        return isUnchanged(info, identifier, options);
+    });
 }
 
 void BTHCodeSigningMapping::withdrawSystemContainer(const std::string& identifier) {

@@ -153,6 +153,12 @@ class BTHCodeSigningMapping {
     // {"sys.kelp.Berth.Entitlements": entitlements} with {"RegByCaller": true}.
     uint64_t processCallerRegisteredEntitlements(const Value& entitlements,
                                                  const std::string& identifier);
+    // Whether a caller's own entitlements would change nothing: the
+    // identifier has code-signing information that the caller did not
+    // register, or its caller-registered entitlements are these already. One
+    // look at the mapping, made for every request of a signed caller.
+    bool callerEntitlementsNeedNoProcessing(const Value& entitlements,
+                                            const std::string& identifier);
 
     // ----- Queries (BTHCodeSigningMapping+Queries.cpp), each on the queue
 

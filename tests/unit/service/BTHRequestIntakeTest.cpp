@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <vector>
 
+#include "BTHCodeSigningEntry.h"
+#include "BTHCodeSigningMapping.h"
 #include "BTHCommandTable.h"
 #include "BTHError.h"
 #include "ScratchDeviceRoot.h"
@@ -157,6 +159,33 @@ TEST(BTHRequestIntakeTest, SpecificEntitlementsAndTheWipeList) {
     client = checkEntitlementsAndInitClientObject(allowedOnly, kBTHEntitlementWipeContainer);
     ASSERT_TRUE(client);
     EXPECT_FALSE(client->entitledWipeIdentifiers());
+}
+
+// A signed caller's own entitlements are registered on its first request and
+// follow it while they are its own; the installer's information, once there,
+// is never overwritten by them.
+TEST(BTHRequestIntakeTest, ACallersOwnEntitlementsStandUntilTheInstallerReportsSome) {
+    if (!kRoot) GTEST_SKIP() << "needs root";
+    BTHCodeSigningMapping* mapping = BTHCodeSigningMapping::sharedInstance();
+    ASSERT_TRUE(mapping);
+    const std::string identifier = "sys.kelp.tester.own-entitlements";
+    auto entitlementsAfterRequestWith = [&](uint64_t version) -> std::optional<Value> {
+        BTHPeerIdentity peer = peerWith(dict({{"sys.kelp.tester.version", version}}));
+        peer.signingIdentifier = identifier;
+        EXPECT_TRUE(checkEntitlementsAndInitClientObject(peer, kBTHEntitlementNone));
+        const std::optional<Value> info = mapping->getCodeSigningInfoForIdentifier(identifier);
+        const Value* entitlements = info ? info->find(kBTHEntitlementsKey) : nullptr;
+        return entitlements ? std::optional<Value>(*entitlements) : std::nullopt;
+    };
+    EXPECT_EQ(entitlementsAfterRequestWith(1), dict({{"sys.kelp.tester.version", uint64_t{1}}}));
+    EXPECT_EQ(entitlementsAfterRequestWith(1), dict({{"sys.kelp.tester.version", uint64_t{1}}}));
+    EXPECT_EQ(entitlementsAfterRequestWith(2), dict({{"sys.kelp.tester.version", uint64_t{2}}}));
+
+    Value installed = Value::dictionary();
+    installed.set(kBTHEntitlementsKey, dict({{"sys.kelp.tester.installed", true}}));
+    ASSERT_EQ(mapping->processCodeSigningInfo(installed, identifier, std::nullopt),
+              BTHErrorSuccess);
+    EXPECT_EQ(entitlementsAfterRequestWith(3), dict({{"sys.kelp.tester.installed", true}}));
 }
 
 TEST(BTHRequestIntakeTest, CommandNumberChecks) {
