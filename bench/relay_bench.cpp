@@ -18,7 +18,12 @@
 //                   daemon's intake (identity, entitlement check, command
 //                   dispatch) and the container cache
 //
+//   daemon (against) the same look-ups through another berthd build, given
+//                   with --against=PATH, on the same device root: the two
+//                   daemons run one after the other for each client count
+//
 //   relay_bench [seconds per measurement, default 2] [path of berthd]
+//               [--against=path of another berthd]
 #include <signal.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -223,12 +228,20 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
     return result;
 }
 
-// A berthd serving `root`, with this program signed into the root's
-// registry; stopped when the object goes.
+// The accounts and homes of a device root, and this program signed into its
+// registry as a client holding ".allowed".
+void prepareRoot(const std::filesystem::path& root) {
+    Value entitlements = Value::dictionary();
+    entitlements.set("sys.kelp.private.Berth.allowed", true);
+    bench::prepareBenchRoot(root, "sys.kelp.bench.client", entitlements);
+}
+
+// A berthd serving a root made by prepareRoot(); stopped when the object
+// goes.
 class Daemon {
   public:
     Daemon(const std::filesystem::path& binary, const std::filesystem::path& root)
-        : prepared_(prepare(root)), daemon_(binary, root) {
+        : daemon_(binary, root) {
         // The container the look-ups find (1: success).
         bench::BenchClient client(daemon_.socket());
         const std::optional<Value> reply = client.exchange(lookupRequest(true));
@@ -242,14 +255,6 @@ class Daemon {
     const std::filesystem::path& socket() const { return daemon_.socket(); }
 
   private:
-    static bool prepare(const std::filesystem::path& root) {
-        Value entitlements = Value::dictionary();
-        entitlements.set("sys.kelp.private.Berth.allowed", true);
-        bench::prepareBenchRoot(root, "sys.kelp.bench.client", entitlements);
-        return true;
-    }
-
-    bool prepared_;  // the root is ready before the daemon starts on it
     bench::BenchDaemon daemon_;
 };
 
@@ -269,23 +274,38 @@ UniqueFd claim(const std::filesystem::path& dir, const std::string& name) {
 
 int main(int argc, char** argv) {
     using namespace berth;
-    const double seconds = argc > 1 ? std::atof(argv[1]) : 2.0;
+    std::vector<std::string> positional;
+    std::string against;
+    for (int i = 1; i < argc; ++i) {
+        const std::string arg = argv[i];
+        if (arg.rfind("--against=", 0) == 0)
+            against = arg.substr(10);
+        else
+            positional.push_back(arg);
+    }
+    const double seconds = !positional.empty() ? std::atof(positional[0].c_str()) : 2.0;
     char templ[] = "/tmp/relay-bench.XXXXXX";
     if (!::mkdtemp(templ)) return 1;
     const std::filesystem::path dir = templ;
     // The daemon's device root; this program reads it too (the registry).
     const std::filesystem::path root = dir / "root";
-    std::unique_ptr<Daemon> daemon;
-    if (argc > 2) {
+    const std::string binary = positional.size() > 1 ? positional[1] : "";
+    if (!binary.empty()) {
         ::setenv("BERTH_ROOT", root.c_str(), 1);
-        daemon = std::make_unique<Daemon>(argv[2], root);
+        prepareRoot(root);
     }
+    // Each daemon row starts its daemon, measures and stops it, so that the
+    // two builds never run at the same time.
+    auto measureDaemon = [&](const std::string& path, int clients) {
+        Daemon daemon(path, root);
+        return measure(daemon.socket(), clients, seconds);
+    };
 
     EchoServer echo(claim(dir, "echo"));
     auto relay = startRelay(claim(dir, "relay"), false);
     auto relayIdentity = startRelay(claim(dir, "relay-identity"), true);
 
-    std::printf("%-15s %7s %12s %10s %10s %9s\n", "server", "clients", "requests/s", "p50 us",
+    std::printf("%-17s %7s %12s %10s %10s %9s\n", "server", "clients", "requests/s", "p50 us",
                 "p99 us", "vs echo");
     for (int clients : {1, 8, 64}) {
         const Result baseline = measure(dir / "echo", clients, seconds);
@@ -294,9 +314,11 @@ int main(int argc, char** argv) {
             {"relay", measure(dir / "relay", clients, seconds)},
             {"relay+identity", measure(dir / "relay-identity", clients, seconds)},
         };
-        if (daemon) rows.emplace_back("daemon", measure(daemon->socket(), clients, seconds));
+        if (!binary.empty()) rows.emplace_back("daemon", measureDaemon(binary, clients));
+        if (!against.empty())
+            rows.emplace_back("daemon (against)", measureDaemon(against, clients));
         for (const auto& [name, result] : rows)
-            std::printf("%-15s %7d %12.0f %10.1f %10.1f %9.2f\n", name, clients,
+            std::printf("%-17s %7d %12.0f %10.1f %10.1f %9.2f\n", name, clients,
                         result.requestsPerSecond, result.p50Microseconds, result.p99Microseconds,
                         baseline.requestsPerSecond > 0
                             ? result.requestsPerSecond / baseline.requestsPerSecond
@@ -308,7 +330,6 @@ int main(int argc, char** argv) {
                 result.requestsPerSecond, "echo server", baseline.requestsPerSecond);
         }
     }
-    daemon.reset();
     relay.reset();
     relayIdentity.reset();
     std::error_code ignored;

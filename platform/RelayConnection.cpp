@@ -154,7 +154,9 @@ void RelayConnection::runInline(const RelayEvent& event) {
         RelayPoller& poller;
         ~GiveBack() { poller.releaseInline(); }
     } giveBack{*poller_};
-    queue_->runClaimed([&] { deliver(event); });
+    // The peer's next request often arrives while this one is still being
+    // wound up; it is then run here too rather than handed to a pool thread.
+    queue_->runClaimed([&] { deliver(event); }, true);
 }
 
 bool RelayConnection::claimInlineLocked() {

@@ -352,7 +352,7 @@ bool WorkQueue::tryClaim() {
     return true;
 }
 
-void WorkQueue::runClaimed(const std::function<void()>& work) {
+void WorkQueue::runClaimed(const std::function<void()>& work, bool drainAfter) {
     // Ends the claim, scheduling what arrived meanwhile, even on a throw.
     struct Release {
         WorkQueue* queue;
@@ -375,6 +375,16 @@ void WorkQueue::runClaimed(const std::function<void()>& work) {
         ~Unwind() { running.resize(depth); }
     } unwind{running, depth};
     work();
+    for (size_t ran = 0; drainAfter && ran < kDrainBatch; ++ran) {
+        WorkItem item;
+        {
+            std::lock_guard lock(mutex_);
+            if (suspendCount_ > 0 || pending_.empty()) break;
+            item = std::move(pending_.front());
+            pending_.pop_front();
+        }
+        runItem(item);
+    }
 }
 
 void WorkQueue::syncInvoke(void (*call)(void*), void* context) {

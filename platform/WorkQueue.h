@@ -125,8 +125,10 @@ class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
     // Runs `work` on the calling thread as this queue's item (isCurrent() is
     // true for it and its targets meanwhile), then ends the claim taken by
     // tryClaim() and schedules what was submitted meanwhile, also when
-    // `work` throws.
-    void runClaimed(const std::function<void()>& work);
+    // `work` throws. With `drainAfter`, items submitted meanwhile run on the
+    // calling thread too, as a drain would run them (a batch at most),
+    // before the claim ends.
+    void runClaimed(const std::function<void()>& work, bool drainAfter = false);
 
     void suspend();
     void resume();
