@@ -4,8 +4,10 @@
 // a termination assertion that kills it and refuses its relaunch until
 // invalidated, and the errors that name a missing prerequisite.
 #include <fcntl.h>
+#include <grp.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/ptrace.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 
@@ -234,6 +236,64 @@ TEST_F(BerthLaunchTest, AContainerSwappedForALinkIsNeverBound) {
     EXPECT_NE(outcome.err.find("berth-launch: "), std::string::npos) << outcome.err;
     fs::remove(group);
     fs::rename(group.string() + ".aside", group);
+}
+
+// The host pids of the processes launched for `identifier`.
+std::vector<pid_t> launchedPids(const LaunchCgroup& cgroups, const std::string& identifier) {
+    std::vector<pid_t> pids;
+    std::error_code error;
+    for (const auto& launch : fs::directory_iterator(cgroups.parentPath() / identifier, error)) {
+        std::ifstream procs(launch.path() / "cgroup.procs");
+        for (pid_t pid = 0; procs >> pid;) pids.push_back(pid);
+    }
+    return pids;
+}
+
+// Whether a process of uid 501 outside the launch can attach to `pid`.
+bool attachableByTheUser(pid_t pid) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+        if (::setgroups(0, nullptr) != 0 || ::setgid(501) != 0 || ::setuid(501) != 0) _exit(2);
+        if (::ptrace(PTRACE_ATTACH, pid, nullptr, nullptr) != 0) _exit(1);
+        ::ptrace(PTRACE_DETACH, pid, nullptr, nullptr);
+        _exit(0);
+    }
+    int status = 0;
+    ::waitpid(child, &status, 0);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) != 2) << "cannot become uid 501";
+    return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+// The service's sysctl drop-in is what keeps the user's other programs from
+// attaching to a launched app and speaking with its identity.
+TEST_F(BerthLaunchTest, WithTheDropInAnotherProcessOfTheUserCannotAttachToALaunchedApp) {
+    const fs::path scope = "/proc/sys/kernel/yama/ptrace_scope";
+    if (!fs::exists(scope))
+        GTEST_SKIP() << "this kernel has no Yama security module (" << scope
+                     << " is missing): the drop-in sets nothing here";
+    const std::string before = test::readFile(scope);
+    struct Restore {
+        fs::path scope;
+        std::string value;
+        ~Restore() { std::ofstream(scope) << value; }
+    } restore{scope, before};
+
+    const std::string identifier = "com.example.attached";
+    const fs::path started = fs::path(*containersOf(identifier).dataContainer) / "started";
+    Launch running(
+        launchArgs(identifier, "echo yes > \"$BERTH_DATA_CONTAINER/started\"; exec sleep 600"));
+    ASSERT_TRUE(test::eventually([&] { return fs::exists(started); }, 20s));
+    const std::vector<pid_t> pids = launchedPids(*cgroups_, identifier);
+    ASSERT_FALSE(pids.empty());
+
+    std::ofstream(scope) << "0\n";
+    if (!attachableByTheUser(pids.front()))
+        GTEST_SKIP() << "the user cannot attach to the app even without the drop-in here "
+                        "(the sandbox keeps it apart), so the drop-in makes no difference";
+    const test::Outcome applied = test::run(
+        "/sbin/sysctl", {"-p", std::string(BERTH_SOURCE_DIR) + "/packaging/berthd.sysctl"});
+    ASSERT_EQ(applied.status, 0) << applied.err;
+    for (const pid_t pid : pids) EXPECT_FALSE(attachableByTheUser(pid)) << "pid " << pid;
 }
 
 TEST_F(BerthLaunchTest, AnAssertionKillsTheProgramAndHoldsItUntilInvalidated) {
