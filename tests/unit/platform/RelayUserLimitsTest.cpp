@@ -143,7 +143,9 @@ TEST_F(RelayUserLimitsTest, BytesBeyondTheUsersBudgetEndTheConnectionThatAskedFo
             UniqueFd greedy = server_->connectRaw();
             if (!test::writeAll(greedy.get(), unfinishedFrame(200 << 10))) return 10;
             if (!served(modest.get(), 1)) return 11;  // within the budget together
-            if (!test::writeAll(greedy.get(), std::vector<uint8_t>(100 << 10, 0x5A))) return 12;
+            // The write itself may fail: the server can end the connection
+            // as soon as it has read the part that crosses the budget.
+            test::writeAll(greedy.get(), std::vector<uint8_t>(100 << 10, 0x5A));
             if (!endedByServer(greedy.get())) return 13;
             // What the ended connection held is given back.
             return served(modest.get(), 2, dict({{"Blob", Value(Value::Data(200 << 10, 1))}})) ? 0
