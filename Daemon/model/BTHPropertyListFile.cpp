@@ -127,4 +127,10 @@ std::optional<Value> BTH_dictionaryWithContentsOfURL(const std::filesystem::path
     return value;
 }
 
+Value BTH_valueAsStored(const Value& value) {
+    const std::optional<std::vector<uint8_t>> bytes = plist::serializeBinary(value);
+    std::optional<Value> stored = bytes ? plist::parse(*bytes) : std::nullopt;
+    return stored ? std::move(*stored) : value;
+}
+
 }  // namespace berth

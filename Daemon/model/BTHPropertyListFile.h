@@ -50,4 +50,9 @@ bool BTH_writeToURL(const Value& dictionary, const std::filesystem::path& url, u
 std::optional<Value> BTH_dictionaryWithContentsOfURL(const std::filesystem::path& url,
                                                      uint32_t options, BTHErrorRef* error);
 
+// `value` as a file written by BTH_writeToURL gives it back: a date keeps only
+// what the format's seconds since 2001 hold. A value that cannot be written
+// is given back unchanged (its write fails anyway).
+Value BTH_valueAsStored(const Value& value);
+
 }  // namespace berth

@@ -9,6 +9,7 @@
 #include "BTHContainerCache.h"
 #include "BTHFaultInjection.h"
 #include "BTHLog.h"
+#include "BTHPropertyListFile.h"
 #include "core/BTHContainerClass.h"
 
 namespace berth {
@@ -24,9 +25,13 @@ bool optionIsTrue(const std::optional<Value>& options, const char* key) {
 
 }  // namespace
 
-uint64_t BTHCodeSigningMapping::processCodeSigningInfo(const std::optional<Value>& info,
+uint64_t BTHCodeSigningMapping::processCodeSigningInfo(const std::optional<Value>& reportedInfo,
                                                        const std::optional<std::string>& identifier,
                                                        const std::optional<Value>& options) {
+    // The mapping holds what its file gives back, so a later start finds
+    // exactly what this one kept.
+    const std::optional<Value> info =
+        reportedInfo ? std::optional<Value>(BTH_valueAsStored(*reportedInfo)) : std::nullopt;
     // Information that changes nothing (a caller's entitlements, refreshed on
     // each of its requests) needs neither the lock nor any container work.
     if (onCodeSignQueue([&] { return isUnchanged(info, identifier, options); }))

@@ -170,6 +170,23 @@ TEST_F(BTHCodeSigningMappingTest, NoFileStartsEmptyAndTheFirstChangeWritesExactl
     EXPECT_EQ(*reloaded->codeSigningMappingDict().at("p.app.ext"), *child);
 }
 
+// Information holding a date the file keeps only to within its precision
+// (seconds since 2001) is kept in memory as the file holds it, so the next
+// start finds the same entry and the same information changes nothing.
+TEST_F(BTHCodeSigningMappingTest, ProcessedInformationIsKeptAsTheFileHoldsIt) {
+    const Value reported = info("sys.kelp.test.date", Value(Value::Date{1e-300}));
+    ASSERT_EQ(mapping_->processCodeSigningInfo(reported, std::string("d.app"), std::nullopt),
+              BTHErrorSuccess);
+    auto reloaded = BTHCodeSigningMapping::create();
+    ASSERT_TRUE(reloaded);
+    EXPECT_EQ(*reloaded->codeSigningMappingDict().at("d.app"),
+              *mapping_->codeSigningMappingDict().at("d.app"));
+    EXPECT_FALSE(rewrites([&] {
+        EXPECT_EQ(mapping_->processCodeSigningInfo(reported, std::string("d.app"), std::nullopt),
+                  BTHErrorSuccess);
+    }));
+}
+
 TEST_F(BTHCodeSigningMappingTest, OnlyRealChangesWriteAndABatchWritesOnce) {
     ASSERT_FALSE(set({entry(info("k", "v")), entry(info())}, {"a.app", "b.app"}));
     // Equal values (other objects), a removal of an unknown identifier, and
