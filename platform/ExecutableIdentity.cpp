@@ -75,6 +75,23 @@ int64_t nanoseconds(const struct timespec& t) {
 
 }  // namespace
 
+FileVersion FileVersion::of(const struct stat& status) {
+    return {status.st_dev,
+            status.st_ino,
+            status.st_size,
+            nanoseconds(status.st_mtim),
+            nanoseconds(status.st_ctim),
+            status.st_mode,
+            status.st_uid,
+            status.st_gid};
+}
+
+bool FileVersion::changedWithin(std::chrono::nanoseconds window) const {
+    struct timespec now {};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    return ctimeNs + window.count() > nanoseconds(now);
+}
+
 Sha256Digest sha256(std::span<const uint8_t> bytes) {
     Sha256Digest digest{};
     unsigned int length = 0;
@@ -181,7 +198,7 @@ std::optional<ExecutableId> runningExecutable(pid_t pid, int pidfd, std::string*
     return ExecutableId{status.st_dev, status.st_ino};
 }
 
-size_t DigestCache::VersionHash::operator()(const Version& v) const noexcept {
+size_t DigestCache::VersionHash::operator()(const FileVersion& v) const noexcept {
     size_t h = std::hash<uint64_t>()(v.inode);
     for (uint64_t part : {static_cast<uint64_t>(v.device), static_cast<uint64_t>(v.size),
                           static_cast<uint64_t>(v.mtimeNs), static_cast<uint64_t>(v.ctimeNs)})
@@ -192,18 +209,13 @@ size_t DigestCache::VersionHash::operator()(const Version& v) const noexcept {
 DigestCache::DigestCache(size_t capacity, std::chrono::nanoseconds racyWindow)
     : capacity_(capacity), racyWindow_(racyWindow) {}
 
-DigestCache::Version DigestCache::versionOf(const struct stat& status) {
-    return {status.st_dev, status.st_ino, status.st_size, nanoseconds(status.st_mtim),
-            nanoseconds(status.st_ctim)};
-}
-
 std::optional<Sha256Digest> DigestCache::digestOf(int fd, std::string* why) {
     struct stat before {};
     if (::fstat(fd, &before) != 0 || !S_ISREG(before.st_mode)) {
         setWhy(why, "not a readable regular file");
         return std::nullopt;
     }
-    const Version version = versionOf(before);
+    const FileVersion version = FileVersion::of(before);
     if (std::optional<Sha256Digest> known = find(version)) return known;
 
     std::optional<Sha256Digest> digest = sha256OfFile(fd, why);
@@ -213,15 +225,15 @@ std::optional<Sha256Digest> DigestCache::digestOf(int fd, std::string* why) {
     }
     if (!digest) return std::nullopt;
     struct stat after {};
-    if (::fstat(fd, &after) != 0 || !(versionOf(after) == version)) {
+    if (::fstat(fd, &after) != 0 || FileVersion::of(after) != version) {
         setWhy(why, "the file changed while it was being hashed");
         return std::nullopt;
     }
-    if (!isRacy(version)) remember(version, *digest);
+    if (!version.changedWithin(racyWindow_)) remember(version, *digest);
     return digest;
 }
 
-std::optional<Sha256Digest> DigestCache::find(const Version& version) {
+std::optional<Sha256Digest> DigestCache::find(const FileVersion& version) {
     std::lock_guard lock(mutex_);
     auto it = slots_.find(version);
     if (it == slots_.end()) return std::nullopt;
@@ -229,7 +241,7 @@ std::optional<Sha256Digest> DigestCache::find(const Version& version) {
     return it->second.digest;
 }
 
-void DigestCache::remember(const Version& version, const Sha256Digest& digest) {
+void DigestCache::remember(const FileVersion& version, const Sha256Digest& digest) {
     std::lock_guard lock(mutex_);
     if (capacity_ == 0 || slots_.contains(version)) return;
     while (slots_.size() >= capacity_) {
@@ -238,12 +250,6 @@ void DigestCache::remember(const Version& version, const Sha256Digest& digest) {
     }
     recency_.push_front(version);
     slots_.emplace(version, Slot{digest, recency_.begin()});
-}
-
-bool DigestCache::isRacy(const Version& version) const {
-    struct timespec now {};
-    ::clock_gettime(CLOCK_REALTIME, &now);
-    return version.ctimeNs + racyWindow_.count() > nanoseconds(now);
 }
 
 uint64_t DigestCache::computations() const {

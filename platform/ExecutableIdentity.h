@@ -9,8 +9,8 @@
 // newcomer that inherited its number.
 //
 // The contents of an executable are identified by their SHA-256 digest.
-// Digests are remembered per file version (device, inode, size, mtime,
-// ctime): any write to a file changes its ctime, which no unprivileged
+// Digests are remembered per file version (device, inode, size, times, mode
+// and owner): any write to a file changes its ctime, which no unprivileged
 // program can set back, so a changed file is always hashed again.
 #pragma once
 
@@ -33,6 +33,26 @@
 namespace berth {
 
 using Sha256Digest = std::array<uint8_t, 32>;
+
+// One version of a file or directory: its identity, size, times, mode and
+// owner. Any write, rename, link, unlink, chmod or chown gives another one,
+// except that two changes within one timestamp tick may share a ctime.
+struct FileVersion {
+    dev_t device = 0;
+    ino_t inode = 0;
+    off_t size = 0;
+    int64_t mtimeNs = 0;
+    int64_t ctimeNs = 0;
+    mode_t mode = 0;
+    uid_t owner = 0;
+    gid_t group = 0;
+
+    static FileVersion of(const struct stat& status);
+    // Whether the file changed within `window` of now: a version that
+    // another change could still share.
+    bool changedWithin(std::chrono::nanoseconds window) const;
+    friend bool operator==(const FileVersion&, const FileVersion&) = default;
+};
 
 // The file a process runs: the pair the message service binds a connection
 // to, so that a peer that execs something else is noticed.
@@ -103,32 +123,22 @@ class DigestCache {
     size_t size() const;
 
   private:
-    struct Version {
-        dev_t device;
-        ino_t inode;
-        off_t size;
-        int64_t mtimeNs;
-        int64_t ctimeNs;
-        friend bool operator==(const Version&, const Version&) = default;
-    };
     struct VersionHash {
-        size_t operator()(const Version& v) const noexcept;
+        size_t operator()(const FileVersion& v) const noexcept;
     };
-    using Recency = std::list<Version>;
+    using Recency = std::list<FileVersion>;
     struct Slot {
         Sha256Digest digest;
         Recency::iterator recency;
     };
 
-    static Version versionOf(const struct stat& status);
-    std::optional<Sha256Digest> find(const Version& version);
-    void remember(const Version& version, const Sha256Digest& digest);
-    bool isRacy(const Version& version) const;
+    std::optional<Sha256Digest> find(const FileVersion& version);
+    void remember(const FileVersion& version, const Sha256Digest& digest);
 
     const size_t capacity_;
     const std::chrono::nanoseconds racyWindow_;
     mutable std::mutex mutex_;
-    std::unordered_map<Version, Slot, VersionHash> slots_;
+    std::unordered_map<FileVersion, Slot, VersionHash> slots_;
     Recency recency_;  // most recently used first
     uint64_t computations_ = 0;
 };

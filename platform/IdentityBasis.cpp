@@ -2,7 +2,6 @@
 
 #include <signal.h>
 #include <sys/syscall.h>
-#include <time.h>
 #include <unistd.h>
 
 #include "platform/ProcessCgroup.h"
@@ -10,10 +9,6 @@
 namespace berth {
 
 namespace {
-
-int64_t nanoseconds(const struct timespec& t) {
-    return static_cast<int64_t>(t.tv_sec) * 1'000'000'000 + t.tv_nsec;
-}
 
 std::optional<FileVersion> versionAt(const std::string& path, bool followLink) {
     struct stat status {};
@@ -23,17 +18,6 @@ std::optional<FileVersion> versionAt(const std::string& path, bool followLink) {
 }
 
 }  // namespace
-
-FileVersion FileVersion::of(const struct stat& status) {
-    return {status.st_dev,
-            status.st_ino,
-            status.st_size,
-            nanoseconds(status.st_mtim),
-            nanoseconds(status.st_ctim),
-            status.st_mode,
-            status.st_uid,
-            status.st_gid};
-}
 
 void IdentityBasis::record(std::filesystem::path path, const struct stat& status) {
     files_.emplace_back(std::move(path), FileVersion::of(status));
@@ -50,11 +34,9 @@ void IdentityBasis::recordCgroup(std::string cgroup) {
 void IdentityBasis::settle(std::chrono::nanoseconds window) {
     settled_ = false;
     if (files_.empty() && !executable_) return;
-    struct timespec now {};
-    ::clock_gettime(CLOCK_REALTIME, &now);
-    const int64_t cutoff = nanoseconds(now) - window.count();
-    auto changedLately = [cutoff](const FileVersion& v) {
-        return S_ISREG(v.mode) && v.ctimeNs >= cutoff;
+    // Only contents read are at stake; directories count by owner and mode.
+    auto changedLately = [window](const FileVersion& v) {
+        return S_ISREG(v.mode) && v.changedWithin(window);
     };
     if (executable_ && changedLately(*executable_)) return;
     for (const auto& [path, version] : files_)

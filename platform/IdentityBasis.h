@@ -22,30 +22,15 @@
 #include <sys/types.h>
 
 #include <chrono>
-#include <cstdint>
 #include <filesystem>
 #include <optional>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "platform/ExecutableIdentity.h"
+
 namespace berth {
-
-// One version of a file or directory: its identity, size, times, mode and
-// owner.
-struct FileVersion {
-    dev_t device = 0;
-    ino_t inode = 0;
-    off_t size = 0;
-    int64_t mtimeNs = 0;
-    int64_t ctimeNs = 0;
-    mode_t mode = 0;
-    uid_t owner = 0;
-    gid_t group = 0;
-
-    static FileVersion of(const struct stat& status);
-    friend bool operator==(const FileVersion&, const FileVersion&) = default;
-};
 
 class IdentityBasis {
   public:

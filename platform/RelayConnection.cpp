@@ -199,13 +199,12 @@ void RelayConnection::pumpLocked(Released& released, std::optional<RelayEvent>* 
             return;
         }
         RelayEvent event = RelayEvent::message(shared_from_this(), std::move(frame));
-        if (runHere && !*runHere && claimInlineLocked()) {
-            ++queued_;
-            runHere->emplace(std::move(event));
-            continue;
-        }
+        const bool runsHere = runHere && !*runHere && claimInlineLocked();
         ++queued_;
-        dispatchLocked(std::move(event));
+        if (runsHere)
+            runHere->emplace(std::move(event));
+        else
+            dispatchLocked(std::move(event));
     }
 }
 
