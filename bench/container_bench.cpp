@@ -78,17 +78,7 @@ double millisecondsSince(Clock::time_point start) {
 
 using bench::BenchClient;
 using bench::BenchDaemon;
-
-Value lookupRequest(uint64_t containerClass, const std::string& identifier, bool create) {
-    Value request = Value::dictionary();
-    request.set("Command", uint64_t{0});
-    request.set("ContainerClass", containerClass);
-    request.set("UserID", kUser);
-    request.set("Identifier", identifier);
-    request.set("CreateIfNecessary", create);
-    request.set("Transient", false);
-    return request;
-}
+using bench::lookupRequest;
 
 std::string rebuiltIdentifier(uint64_t index) {
     return "sys.kelp.bench.existing." + std::to_string(index);

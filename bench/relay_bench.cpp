@@ -169,17 +169,9 @@ struct Result {
     double p99Microseconds = 0;
 };
 
-// Command 0 for the Data/Application container of the bench client and user
-// 501; `create` makes it when it is missing.
+// The bench client's own Data/Application container of user 501.
 Value lookupRequest(bool create) {
-    Value request = Value::dictionary();
-    request.set("Command", uint64_t{0});
-    request.set("ContainerClass", uint64_t{2});
-    request.set("UserID", uint64_t{501});
-    request.set("Identifier", "sys.kelp.bench.client");
-    request.set("CreateIfNecessary", create);
-    request.set("Transient", false);
-    return request;
+    return bench::lookupRequest(2, "sys.kelp.bench.client", create);
 }
 
 Result measure(const std::filesystem::path& path, int clients, double seconds) {

@@ -87,13 +87,7 @@ bench::RoundTripFunction upcallClient(const std::filesystem::path& socket,
 
 bench::RoundTripFunction lookupClient(const std::filesystem::path& socket) {
     auto client = std::make_shared<bench::BenchClient>(socket);
-    Value request = Value::dictionary();
-    request.set("Command", uint64_t{0});
-    request.set("ContainerClass", uint64_t{2});
-    request.set("UserID", uint64_t{501});
-    request.set("Identifier", kApp);
-    request.set("CreateIfNecessary", false);
-    request.set("Transient", false);
+    const Value request = bench::lookupRequest(2, kApp, false);
     return [client, request](uint64_t) {
         const uint64_t code = client->connected() ? client->call(request) : 0;
         if (code == 0) return bench::RoundTrip::kBroken;

@@ -48,6 +48,17 @@ void prepareBenchRoot(const fs::path& root, const std::string& identifier,
         throw std::runtime_error("sign: " + why);
 }
 
+Value lookupRequest(uint64_t containerClass, const std::string& identifier, bool create) {
+    Value request = Value::dictionary();
+    request.set("Command", uint64_t{0});
+    request.set("ContainerClass", containerClass);
+    request.set("UserID", uint64_t{501});
+    request.set("Identifier", identifier);
+    request.set("CreateIfNecessary", create);
+    request.set("Transient", false);
+    return request;
+}
+
 BenchClient::BenchClient(const fs::path& socketPath, std::chrono::seconds patience) {
     fd_.reset(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address{};

@@ -24,6 +24,10 @@ namespace berth::bench {
 void prepareBenchRoot(const std::filesystem::path& root, const std::string& identifier,
                       const Value& entitlements);
 
+// Command 0 for the container of `identifier` in `containerClass` of user
+// 501 (not transient); `create` makes it when it is missing.
+Value lookupRequest(uint64_t containerClass, const std::string& identifier, bool create);
+
 // Makes a scratch directory named after `name`, points BERTH_ROOT at its
 // "root" (the daemon modules a benchmark uses read it once: call this before
 // any of them runs) and runs `body` with that root. A failure is printed and
