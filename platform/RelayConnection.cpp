@@ -140,22 +140,32 @@ void RelayConnection::ready(uint32_t events) {
         if ((events & EPOLLOUT) && !flushLocked(released)) return;
         if (events & EPOLLIN) {
             readLocked(released, &runHere);
-        } else if (events & (EPOLLHUP | EPOLLERR)) {
+        } else if (events & (EPOLLHUP | EPOLLERR | EPOLLRDHUP)) {
             closeLocked(kLogDebug, "the peer hung up", released);
         }
         chargeLocked(released);
+        if (runHere) runningInline_ = true;
         updateInterestLocked(true);
     }
     if (runHere) runInline(*runHere);
 }
 
 void RelayConnection::runInline(const RelayEvent& event) {
-    struct GiveBack {
-        RelayPoller& poller;
-        ~GiveBack() { poller.releaseInline(); }
-    } giveBack{*poller_};
-    // The peer's next request often arrives while this one is still being
-    // wound up; it is then run here too rather than handed to a pool thread.
+    // Gives back the poller's place, then reads the socket again, even on a
+    // throw: the peer's next request then finds a free place and an idle
+    // queue, and runs inline too.
+    struct Rearm {
+        RelayConnection& connection;
+        ~Rearm() {
+            connection.poller_->releaseInline();
+            Released released(connection);
+            std::lock_guard lock(connection.mutex_);
+            connection.runningInline_ = false;
+            connection.updateInterestLocked(true);
+        }
+    } rearm{*this};
+    // Requests already buffered when this one ends run here too rather than
+    // being handed to a pool thread.
     queue_->runClaimed([&] { deliver(event); }, true);
 }
 
@@ -233,8 +243,12 @@ bool RelayConnection::flushLocked(Released& released) {
 void RelayConnection::updateInterestLocked(bool rearm) {
     if (closed_ || token_ == 0) return;
     uint32_t wanted = 0;
-    if (queued_ < options_.limits.maxQueuedRequests &&
-        pendingOutputLocked() <= options_.limits.outputHighWater)
+    // While a request runs inline, only the peer's hang-up is waited for:
+    // it still ends the connection at once.
+    if (runningInline_)
+        wanted |= EPOLLRDHUP;
+    else if (queued_ < options_.limits.maxQueuedRequests &&
+             pendingOutputLocked() <= options_.limits.outputHighWater)
         wanted |= EPOLLIN;
     if (pendingOutputLocked() > 0) wanted |= EPOLLOUT;
     if (wanted == interest_ && !rearm) return;

@@ -245,6 +245,10 @@ class RelayConnection final : public RelayPoller::Watcher,
     uint32_t interest_ = 0;
     bool resumed_ = false;
     bool closed_ = false;
+    // A request read by a poller thread runs on it: the socket is not read
+    // meanwhile, so the peer's next request does not reach another thread
+    // only to wait for this one.
+    bool runningInline_ = false;
     EventHandler handler_;
     relay::FrameDecoder decoder_;
     size_t queued_ = 0;  // requests dispatched and not yet handled

@@ -184,6 +184,8 @@ class CreateOrLookup {
 
     enum class Found { kNone, kContainer, kFailure };
 
+    bool transient() const { return transient_; }
+
     // Step 6. kContainer: the permanent container in `*result`; kFailure:
     // the look-up failed with anything but "not found" (or a transient
     // container could not be retired); kNone: there is none (any transient
@@ -202,7 +204,7 @@ class CreateOrLookup {
         if (!transient_) {
             // The caller gets a snapshot: the cached record may change once
             // the lock is released.
-            *result = std::make_shared<BTHMetadata>(*found);
+            *result = cache.snapshotOf(*found);
             (*result)->setExisted(true);
             // The container may be another call's creation whose rename is
             // not durable yet: the caller waits for it before answering.
@@ -396,8 +398,9 @@ class CreateOrLookup {
 };
 
 // Runs one create or look-up. With `useLocking`, the all-identifiers lock is
-// held for the look-up and, when a container must be made, again for the
-// second look-up and the rename; the container is staged between the two,
+// held for the look-up (for reading, unless a transient container may have
+// to be retired) and, when a container must be made, again, for writing, for
+// the second look-up and the rename; the container is staged between the two,
 // so concurrent creations build and sync their trees in parallel and only
 // check-and-rename one at a time. The second look-up keeps creation of one
 // identifier serialised: a concurrent call that got there first wins and its
@@ -409,7 +412,10 @@ BTHMetadataRef createOrLookup(CreateOrLookup& operation, bool createIfNecessary,
     BTHMetadataRef result;
     Found found;
     {
-        BTHAllIdentifiersLockGuard lock(true, useLocking);
+        // Finding a permanent container changes nothing, so concurrent
+        // look-ups share the lock; only retiring a transient container, or
+        // making one, excludes everyone else.
+        BTHAllIdentifiersLockGuard lock(operation.transient(), useLocking);
         found = operation.lookUp(&result, error);
         if (found == Found::kFailure) return nullptr;
         if (found == Found::kNone && !createIfNecessary) {

@@ -279,6 +279,11 @@ bool BTHContainerCache::removeContainerForUser(uid_t userId, uint64_t containerC
     }
 }
 
+BTHMetadataRef BTHContainerCache::snapshotOf(const BTHMetadata& record) {
+    std::lock_guard lock(cacheLock_);
+    return std::make_shared<BTHMetadata>(record);
+}
+
 void BTHContainerCache::resetForTesting() {
     std::lock_guard lock(cacheLock_);
     liveContainerCache_.clear();

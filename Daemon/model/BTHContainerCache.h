@@ -65,6 +65,11 @@ class BTHContainerCache {
     BTHMetadataRef containerForUser(uid_t userId, uint64_t containerClass,
                                     const std::string& identifier, const std::string& uuidString);
 
+    // A copy of `record` as it is now, taken under the cache's lock: the
+    // cache changes a few of a shared record's fields under that lock alone,
+    // while the record's identifier is held only for reading.
+    BTHMetadataRef snapshotOf(const BTHMetadata& record);
+
     // Every entry whose metadata file still exists (the others are logged
     // and left out; the call still succeeds). An empty map gives an empty
     // array.
