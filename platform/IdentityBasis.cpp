@@ -44,12 +44,36 @@ void IdentityBasis::settle(std::chrono::nanoseconds window) {
     settled_ = true;
 }
 
-bool IdentityBasis::holds(pid_t pid, int pidfd) const {
+void IdentityBasis::watchWith(std::shared_ptr<ChangeWatch> watch) {
+    watch_ = std::move(watch);
+    watched_ = false;
+    // Watched at once, so the very next check may rely on the watch; files
+    // that changed since they were recorded leave it unwatched, and that
+    // check finds them changed.
+    filesHold();
+}
+
+bool IdentityBasis::filesHold() {
+    if (watched_ && watch_->unchangedSince(watchedSince_)) return true;
+    watched_ = false;
+    // The moment comes first: a change after it is either seen by the stats
+    // below or counted by the watch.
+    const uint64_t moment = watch_ ? watch_->now() : 0;
+    bool watched = watch_ != nullptr;
+    for (const auto& [path, version] : files_)
+        if (watched && !watch_->watch(path)) watched = false;
+    for (const auto& [path, version] : files_)
+        if (versionAt(path, false) != version) return false;
+    watched_ = watched;
+    watchedSince_ = moment;
+    return true;
+}
+
+bool IdentityBasis::holds(pid_t pid, int pidfd) {
     if (pid <= 0 || pidfd < 0) return false;
     const std::string proc = "/proc/" + std::to_string(pid);
     if (executable_ && versionAt(proc + "/exe", true) != executable_) return false;
-    for (const auto& [path, version] : files_)
-        if (versionAt(path, false) != version) return false;
+    if (!filesHold()) return false;
     if (cgroup_) {
         std::string why;
         if (cgroupShownFor(pid, &why) != cgroup_) return false;

@@ -12,6 +12,11 @@
 // path, so a basis that still holds stands for an evaluation that would
 // read the same bytes under the same owners.
 //
+// With a ChangeWatch, the files and directories are checked by the watch
+// while it has seen no change (one call), and stat'ed one by one only when it
+// has, or may have: the executable (whose contents a memory mapping could
+// change unseen), the control group and the process are checked every time.
+//
 // Contents are told apart by their change time, which only the kernel sets.
 // A regular file changed within `window` of its recording could change again
 // within the same timestamp tick and keep its version; a basis holding such
@@ -23,11 +28,13 @@
 
 #include <chrono>
 #include <filesystem>
+#include <memory>
 #include <optional>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "platform/ChangeWatch.h"
 #include "platform/ExecutableIdentity.h"
 
 namespace berth {
@@ -49,16 +56,30 @@ class IdentityBasis {
     // Only a settled basis may stand for a later evaluation.
     bool settled() const { return settled_; }
 
+    // Lets holds() rely on `watch` for the files and directories recorded,
+    // from now on.
+    void watchWith(std::shared_ptr<ChangeWatch> watch);
+
     // Whether everything recorded is still as it was, for the process `pid`
     // that `pidfd` refers to. The process is confirmed alive last, so what
-    // /proc showed of `pid` was its own.
-    bool holds(pid_t pid, int pidfd) const;
+    // /proc showed of `pid` was its own. Not safe to call from two threads
+    // at once.
+    bool holds(pid_t pid, int pidfd);
 
   private:
+    // Whether every recorded file and directory is as it was; watches them
+    // anew when the watch saw a change, or may have.
+    bool filesHold();
+
     std::vector<std::pair<std::filesystem::path, FileVersion>> files_;
     std::optional<FileVersion> executable_;
     std::optional<std::string> cgroup_;
     bool settled_ = false;
+    std::shared_ptr<ChangeWatch> watch_;
+    // Set while the watch stands for the files: all of them watched and
+    // found as recorded after `watchedSince`.
+    bool watched_ = false;
+    uint64_t watchedSince_ = 0;
 };
 
 }  // namespace berth

@@ -9,6 +9,8 @@
 #include <cstring>
 #include <thread>
 
+#include "platform/ChangeWatch.h"
+
 namespace berth {
 namespace {
 
@@ -39,6 +41,10 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
           // Kept for the moment the process runs out of descriptors.
           reserve_(::open("/dev/null", O_RDONLY | O_CLOEXEC)) {
         if (!options_.codeSigning) options_.codeSigning = std::make_shared<CodeSigningRegistry>();
+        // Without one, remembered identities are checked file by file.
+        std::string why;
+        changeWatch_ = ChangeWatch::make(&why);
+        if (!changeWatch_) log(kLogError, "identities are checked without a watch: " + why);
     }
 
     void setEventHandler(EventHandler handler) {
@@ -112,7 +118,7 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
     void adopt(UniqueFd socket) {
         std::string why;
         std::optional<RelayPeer> peer =
-            RelayPeer::ofSocket(socket.get(), options_.codeSigning, &why);
+            RelayPeer::ofSocket(socket.get(), options_.codeSigning, &why, changeWatch_);
         if (!peer) {
             log(kLogError, "refusing a connection: " + why);
             return;
@@ -158,6 +164,7 @@ class RelayListener::Acceptor final : public RelayPoller::Watcher {
     const std::shared_ptr<RelayPoller> poller_;
     const std::shared_ptr<RelayUserBudget> budget_;
     UniqueFd reserve_;
+    std::shared_ptr<ChangeWatch> changeWatch_;  // shared by the peers' identities
 
     mutable std::mutex mutex_;
     EventHandler handler_;

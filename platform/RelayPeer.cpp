@@ -61,7 +61,7 @@ UniqueFd peerPidfd(int fd, const ucred& cred, std::string* why) {
 }  // namespace
 
 std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigningService> signing,
-                                             std::string* why) {
+                                             std::string* why, std::shared_ptr<ChangeWatch> watch) {
     ucred cred{};
     socklen_t length = sizeof cred;
     if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &length) != 0) {
@@ -73,6 +73,7 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
     peer.uid_ = cred.uid;
     peer.gid_ = cred.gid;
     peer.signing_ = std::move(signing);
+    peer.watch_ = std::move(watch);
     if (cred.pid <= 0) {
         // The peer lives in a pid namespace this one cannot see.
         peer.unboundReason_ = "the peer's process is not visible to the daemon";
@@ -93,6 +94,7 @@ RelayPeerIdentity RelayPeer::identity() const {
     if (evaluated.signingIdentifier && basis.settled()) {
         remembered = evaluated;
         remembered_->basis = std::move(basis);
+        if (watch_) remembered_->basis.watchWith(watch_);
     } else {
         remembered.reset();
     }

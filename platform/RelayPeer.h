@@ -41,6 +41,7 @@
 #include <string>
 
 #include "core/Value.h"
+#include "platform/ChangeWatch.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/ExecutableIdentity.h"
 #include "platform/UniqueFd.h"
@@ -69,8 +70,11 @@ class RelayPeer {
     // the peer of the connected socket `fd`. Fails (nullopt, with the reason)
     // only when the kernel gives no credentials; a peer whose pidfd or
     // executable cannot be had is kept, with no identity.
+    // With `watch`, what a remembered identity rests on is checked through
+    // it (see IdentityBasis).
     static std::optional<RelayPeer> ofSocket(int fd, std::shared_ptr<CodeSigningService> signing,
-                                             std::string* why = nullptr);
+                                             std::string* why = nullptr,
+                                             std::shared_ptr<ChangeWatch> watch = nullptr);
 
     RelayPeer(RelayPeer&&) noexcept = default;
     RelayPeer& operator=(RelayPeer&&) noexcept = default;
@@ -108,6 +112,7 @@ class RelayPeer {
     std::optional<ExecutableId> bound_;  // root's peers only
     std::string unboundReason_;          // why there is no identity to be had
     std::shared_ptr<CodeSigningService> signing_;
+    std::shared_ptr<ChangeWatch> watch_;
     std::unique_ptr<Remembered> remembered_ = std::make_unique<Remembered>();
 };
 

@@ -1,0 +1,131 @@
+#include "platform/ChangeWatch.h"
+
+#include <sys/inotify.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+namespace berth {
+
+namespace {
+
+// What changes an item or the names in a directory. Access, opening and
+// closing change nothing.
+constexpr uint32_t kMask = IN_ATTRIB | IN_MODIFY | IN_CREATE | IN_DELETE | IN_MOVED_FROM |
+                           IN_MOVED_TO | IN_MOVE_SELF | IN_DELETE_SELF;
+
+// Names noted across all watches; beyond it nothing more is watched, so a
+// daemon that meets ever new files keeps bounded memory.
+constexpr size_t kMaxNames = size_t{1} << 16;
+
+}  // namespace
+
+std::unique_ptr<ChangeWatch> ChangeWatch::make(std::string* why) {
+    UniqueFd inotify(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+    if (!inotify) {
+        if (why) *why = std::string("no inotify instance: ") + strerror(errno);
+        return nullptr;
+    }
+    return std::make_unique<ChangeWatch>(Passkey{}, std::move(inotify));
+}
+
+uint64_t ChangeWatch::now() {
+    drain();
+    return changes_.load();
+}
+
+bool ChangeWatch::watch(const std::filesystem::path& path) {
+    std::string item = path.lexically_normal().string();
+    while (item.size() > 1 && item.back() == '/') item.pop_back();
+    if (item.empty() || item.front() != '/') return false;
+    std::lock_guard lock(mutex_);
+    if (!watchItem(item, {})) return false;
+    while (item != "/") {
+        const size_t slash = item.rfind('/');
+        const std::string name = item.substr(slash + 1);
+        item = slash == 0 ? std::string("/") : item.substr(0, slash);
+        if (!watchItem(item, name)) return false;
+    }
+    return true;
+}
+
+bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string& child) {
+    // The item itself is watched as it is (a link as a link, as it was
+    // recorded); a directory on the way is watched where it leads, since the
+    // names below it are looked up there.
+    const uint32_t mask = child.empty() ? kMask | IN_DONT_FOLLOW : kMask;
+    const int wd = ::inotify_add_watch(inotify_.get(), path.c_str(), mask);
+    if (wd < 0) return false;
+    std::set<std::string>& names = names_[wd];
+    if (child.empty() || names.count(child)) return true;
+    if (nameCount_ >= kMaxNames) return false;
+    names.insert(child);
+    ++nameCount_;
+    return true;
+}
+
+bool ChangeWatch::unchangedSince(uint64_t moment) {
+    // Without taking the lock: nothing was counted since `moment`, nothing is
+    // queued, and no thread began reading the queue meanwhile (it could hold
+    // an event not yet counted). Any doubt: read the queue, as one thread at
+    // a time does, and count.
+    const uint64_t reading = reading_.load();
+    if (changes_.load() != moment) return false;
+    int queued = 0;
+    if ((reading & 1) == 0 && ::ioctl(inotify_.get(), FIONREAD, &queued) == 0 && queued == 0 &&
+        reading_.load() == reading)
+        return true;
+    drain();
+    return changes_.load() == moment;
+}
+
+void ChangeWatch::drain() {
+    std::lock_guard lock(mutex_);
+    reading_.fetch_add(1);
+    uint64_t found = 0;
+    alignas(inotify_event) char buffer[16 * 1024];
+    for (;;) {
+        const ssize_t count = ::read(inotify_.get(), buffer, sizeof buffer);
+        if (count < 0 && errno == EINTR) continue;
+        if (count <= 0) {
+            // Anything but an empty queue leaves the queue unknown.
+            if (count == 0 || errno != EAGAIN) ++found;
+            break;
+        }
+        for (ssize_t at = 0; at < count;) {
+            const auto* event = reinterpret_cast<const inotify_event*>(buffer + at);
+            if (isChange(event->wd, event->mask, event->len ? event->name : nullptr)) ++found;
+            at += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
+        }
+    }
+    if (found) changes_.fetch_add(found);
+    reading_.fetch_add(1);
+}
+
+bool ChangeWatch::isChange(int wd, uint32_t mask, const char* name) {
+    if (mask & IN_Q_OVERFLOW) return true;
+    const auto watched = names_.find(wd);
+    if (mask & IN_IGNORED) {
+        // The item is gone (or its file system): so is the kernel's watch.
+        if (watched != names_.end()) {
+            nameCount_ -= watched->second.size();
+            names_.erase(watched);
+        }
+        return true;
+    }
+    if (watched == names_.end()) return false;
+    if (!name || !*name) return true;  // the item itself
+    std::set<std::string>& names = watched->second;
+    const auto found = names.find(name);
+    if (found == names.end()) return false;
+    if (mask & (IN_DELETE | IN_MOVED_FROM)) {
+        // Whoever relied on the name watches it again before relying anew.
+        names.erase(found);
+        --nameCount_;
+    }
+    return true;
+}
+
+}  // namespace berth

@@ -1,0 +1,88 @@
+// Tells with one cheap call that none of a set of files and directories has
+// changed since a moment, so that a decision resting on them need not be
+// re-checked item by item.
+//
+// Each watched item is watched by the kernel (inotify) together with its name
+// in every directory above it up to "/": a write, truncation, chmod, chown or
+// link-count change of the item, a rename or removal of it or of any
+// directory on the way, or another item put in its place shows up as an
+// event. Events for other names in those directories are not changes.
+//
+// The kernel queues an event before the system call that caused it returns,
+// so a change completed before unchangedSince() is asked is seen by it: either
+// still queued (the call reads the queue) or already read by another thread
+// (a reader announces itself before it reads; see the implementation). A
+// queue that overflowed counts as a change of everything.
+//
+// Not seen, and so to be checked otherwise by whoever relies on the watch:
+// writes through a shared memory mapping, and anything about a process (what
+// it runs, which group it is in). Watches are never given up while the item
+// exists; the kernel drops them when it goes.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <filesystem>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <string>
+
+#include "platform/UniqueFd.h"
+
+namespace berth {
+
+class ChangeWatch {
+    struct Passkey {};
+
+  public:
+    // A watch with an inotify instance of its own; null, with the reason,
+    // when the kernel gives none (then nothing can be watched).
+    static std::unique_ptr<ChangeWatch> make(std::string* why = nullptr);
+    ChangeWatch(Passkey, UniqueFd inotify) : inotify_(std::move(inotify)) {}
+    ChangeWatch(const ChangeWatch&) = delete;
+    ChangeWatch& operator=(const ChangeWatch&) = delete;
+
+    // The moment to compare with later. Take it before the checks that the
+    // watch is to stand for: a change after it is then either seen by those
+    // checks or by unchangedSince().
+    uint64_t now();
+
+    // Watches the item at the absolute `path` (a last link is watched itself,
+    // not followed) and its name in each directory above it. False when any
+    // of it cannot be watched (a component is missing, the kernel's limit of
+    // watches is reached): a decision resting on `path` must not rely on
+    // the watch then.
+    bool watch(const std::filesystem::path& path);
+
+    // True when no watched item changed since `moment`; false when one did,
+    // or may have.
+    bool unchangedSince(uint64_t moment);
+
+  private:
+    // Reads every queued event, counting the changes among them.
+    void drain();
+    // Whether an event is a change of something watched; forgets names and
+    // watches that the event shows are gone. Called with mutex_ held.
+    bool isChange(int wd, uint32_t mask, const char* name);
+    // Adds (or finds) the kernel's watch of `path` and, when `child` is not
+    // empty, takes note of that name in it. Called with mutex_ held.
+    bool watchItem(const std::filesystem::path& path, const std::string& child);
+
+    const UniqueFd inotify_;
+    // Changes seen so far; a moment is a value of it.
+    std::atomic<uint64_t> changes_{0};
+    // Odd while a thread reads the queue: announced before the read, so a
+    // caller that found the queue empty can tell that events may have been
+    // taken from under it.
+    std::atomic<uint64_t> reading_{0};
+
+    std::mutex mutex_;  // one reader of the queue at a time; guards names_
+    // Per kernel watch, the names in it that matter (empty for a watch of an
+    // item itself only).
+    std::map<int, std::set<std::string>> names_;
+    size_t nameCount_ = 0;
+};
+
+}  // namespace berth
