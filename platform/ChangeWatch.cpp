@@ -11,10 +11,18 @@ namespace berth {
 
 namespace {
 
-// What changes an item or the names in a directory. Access, opening and
-// closing change nothing.
-constexpr uint32_t kMask = IN_ATTRIB | IN_MODIFY | IN_CREATE | IN_DELETE | IN_MOVED_FROM |
-                           IN_MOVED_TO | IN_MOVE_SELF | IN_DELETE_SELF;
+// What changes the names in a directory, or its owner and mode. Writes into
+// its files are left out: in a busy directory on the way ("/tmp", say) they
+// would be most of the events, and none of them is a change.
+constexpr uint32_t kDirectoryMask =
+    IN_ATTRIB | IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MOVE_SELF | IN_DELETE_SELF;
+// What changes a watched item itself: the above and its contents.
+constexpr uint32_t kItemMask = kDirectoryMask | IN_MODIFY;
+
+// Reads of the queue per drain. A queue still not empty after them is taken
+// for a change, so a flood of events costs the callers their stats but never
+// holds them in the drain.
+constexpr int kMaxReadsPerDrain = 4;
 
 // Names noted across all watches; beyond it nothing more is watched, so a
 // daemon that meets ever new files keeps bounded memory.
@@ -55,7 +63,7 @@ bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string
     // The item itself is watched as it is (a link as a link, as it was
     // recorded); a directory on the way is watched where it leads, since the
     // names below it are looked up there.
-    const uint32_t mask = child.empty() ? kMask | IN_DONT_FOLLOW : kMask;
+    const uint32_t mask = child.empty() ? kItemMask | IN_DONT_FOLLOW : kDirectoryMask;
     const int wd = ::inotify_add_watch(inotify_.get(), path.c_str(), mask);
     if (wd < 0) return false;
     std::set<std::string>& names = names_[wd];
@@ -86,7 +94,11 @@ void ChangeWatch::drain() {
     reading_.fetch_add(1);
     uint64_t found = 0;
     alignas(inotify_event) char buffer[16 * 1024];
-    for (;;) {
+    for (int reads = 0;; ++reads) {
+        if (reads == kMaxReadsPerDrain) {
+            ++found;
+            break;
+        }
         const ssize_t count = ::read(inotify_.get(), buffer, sizeof buffer);
         if (count < 0 && errno == EINTR) continue;
         if (count <= 0) {

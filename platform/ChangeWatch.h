@@ -6,7 +6,11 @@
 // in every directory above it up to "/": a write, truncation, chmod, chown or
 // link-count change of the item, a rename or removal of it or of any
 // directory on the way, or another item put in its place shows up as an
-// event. Events for other names in those directories are not changes.
+// event. Events for other names in those directories are not changes, and
+// writes into other files there are not even asked for. A queue that holds
+// more events than a few reads take counts as a change, so that a flood of
+// events in a busy directory costs the callers their own checks and never
+// keeps them reading.
 //
 // The kernel queues an event before the system call that caused it returns,
 // so a change completed before unchangedSince() is asked is seen by it: either

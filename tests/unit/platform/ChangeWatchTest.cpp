@@ -95,6 +95,20 @@ TEST_F(ChangeWatchTest, OtherNamesInTheSameDirectoriesAreNoChange) {
     EXPECT_TRUE(watch_->unchangedSince(moment));
 }
 
+TEST_F(ChangeWatchTest, AFloodOfOtherEventsCountsAsAChangeRatherThanBeingReadWithoutEnd) {
+    const uint64_t moment = watched();
+    // Alternating names, since the kernel folds an event into an identical
+    // one just before it.
+    test::writeFile(dir_ / "a/b/second", "second");
+    for (int i = 0; i < 5000; ++i)
+        stdfs::permissions(dir_ / (i % 2 ? "a/b/other" : "a/b/second"), stdfs::perms(0600));
+    EXPECT_FALSE(watch_->unchangedSince(moment));
+    // Once the queue is read to its end, the watch stands for a new moment.
+    uint64_t after = watch_->now();
+    for (uint64_t next; (next = watch_->now()) != after;) after = next;
+    EXPECT_TRUE(watch_->unchangedSince(after));
+}
+
 TEST_F(ChangeWatchTest, ANameSeenGoneMustBeWatchedAgainToCount) {
     uint64_t moment = watched();
     stdfs::remove(item());
