@@ -87,16 +87,21 @@ int linkOrNotDirectory(int dirFd, const char* name) {
 UniqueFd openNoFollow(const std::filesystem::path& path, int flags, mode_t mode) {
     flags |= O_NOFOLLOW | O_CLOEXEC;
     const std::filesystem::path& root = DeviceRoot::path();
-    UniqueFd base;
+    int base = -1;
+    UniqueFd ownBase;
     std::string relative = path.string();
     if (!DeviceRoot::isHost() && isBelow(path, root)) {
-        base.reset(::open(root.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
-        if (!base) return {};
+        base = DeviceRoot::descriptor();
+        if (base < 0) {
+            ownBase.reset(::open(root.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+            if (!ownBase) return {};
+            base = ownBase.get();
+        }
         relative = relative.substr(root.string().size() + 1);
     }
-    const int dirFd = base ? base.get() : AT_FDCWD;
+    const int dirFd = base >= 0 ? base : AT_FDCWD;
     const uint64_t resolve =
-        RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | (base ? RESOLVE_BENEATH : 0);
+        RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS | (base >= 0 ? RESOLVE_BENEATH : 0);
     long fd = openat2Call(dirFd, relative.c_str(), flags, mode, resolve);
     if (fd >= 0) return UniqueFd(static_cast<int>(fd));
     if (errno == ENOTDIR && (flags & O_DIRECTORY)) {
@@ -111,7 +116,7 @@ UniqueFd openNoFollow(const std::filesystem::path& path, int flags, mode_t mode)
         return {};
     }
     if (errno != ENOSYS) return {};
-    if (base) return walkComponents(base.get(), relative, flags, mode);
+    if (base >= 0) return walkComponents(base, relative, flags, mode);
     UniqueFd slash(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
     return walkComponents(slash.get(), relative, flags, mode);
 }

@@ -29,6 +29,7 @@
 #include "BTHUpcallServer.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/DeviceProperties.h"
+#include "platform/DeviceRoot.h"
 #include "platform/LockStateNotification.h"
 #include "platform/NamedSemaphore.h"
 #include "platform/ProcessAttachPolicy.h"
@@ -214,6 +215,8 @@ int BTHDaemonMain() {
     RunLoop& runLoop = RunLoop::main();
     RelayTransaction::begin();  // step 1: busy until start-up is done
     BTHFaultInjectionLoadFromEnvironment();
+    // Every link-safe open beneath a scratch root starts from it.
+    DeviceRoot::keepOpen();
     openRotatingLog();
     BTHSetExceptionReporter(BTHReportUncaughtException);
 

@@ -5,7 +5,9 @@
 
 #include <fcntl.h>
 
+#include "ScratchDeviceRoot.h"
 #include "TestSupport.h"
+#include "platform/DeviceRoot.h"
 
 namespace berth {
 namespace {
@@ -69,6 +71,30 @@ TEST(SafeFsTest, CheckedOpensRefuseAnItemOtherThanTheOneSeen) {
     ASSERT_EQ(::mkfifo((dir / "fifo").c_str(), 0600), 0);
     ASSERT_EQ(::fstatat(parent.get(), "fifo", &seen, AT_SYMLINK_NOFOLLOW), 0);
     EXPECT_FALSE(fs::openItemChecked(parent.get(), "fifo", seen));  // never opened
+}
+
+// The daemon keeps its root open; opens beneath it still refuse links and
+// never climb out of it.
+TEST(SafeFsTest, OpensBeneathAKeptDeviceRootStillRefuseLinksAndStayInside) {
+    const stdfs::path& root = test::installScratchDeviceRoot();
+    if (DeviceRoot::path() != root) GTEST_SKIP() << "this process fixed its device root earlier";
+    ASSERT_TRUE(DeviceRoot::keepOpen());
+    const int kept = DeviceRoot::descriptor();
+    ASSERT_GE(kept, 0);
+    ASSERT_TRUE(DeviceRoot::keepOpen());
+    EXPECT_EQ(DeviceRoot::descriptor(), kept);
+
+    stdfs::create_directories(root / "private/var/kept/dir");
+    test::writeFile(root / "private/var/kept/dir/file", "f");
+    stdfs::create_directory_symlink(root / "private/var/kept/dir", root / "private/var/kept/link");
+    EXPECT_TRUE(fs::openNoFollow(root / "private/var/kept/dir/file", O_RDONLY));
+    EXPECT_FALSE(fs::openNoFollow(root / "private/var/kept/link/file", O_RDONLY));
+    EXPECT_EQ(errno, ELOOP);
+    EXPECT_FALSE(fs::openNoFollow(root / "private/../../etc/passwd", O_RDONLY));
+    EXPECT_EQ(errno, EXDEV);
+    struct stat st;
+    EXPECT_EQ(fs::lstatNoFollow(root / "private/var/kept/link", &st), 0);
+    EXPECT_TRUE(S_ISLNK(st.st_mode));
 }
 
 }  // namespace
