@@ -179,7 +179,7 @@ std::unique_ptr<RelayListener> RelayListener::make(UniqueFd socket,
                                                    Options options, std::string* why) {
     std::shared_ptr<RelayPoller> poller = RelayPoller::start(
         options.label.substr(0, 11) + ".io",
-        options.ioThreads ? options.ioThreads : std::thread::hardware_concurrency() + 1, why);
+        options.ioThreads ? options.ioThreads : 2 * std::thread::hardware_concurrency() + 1, why);
     if (!poller) return nullptr;
     auto acceptor =
         std::make_shared<Acceptor>(std::move(socket), std::move(queue), std::move(options), poller);

@@ -46,7 +46,10 @@ class RelayListener {
         // root's signature registry.
         std::shared_ptr<CodeSigningService> codeSigning;
         RelayLimits limits;
-        // I/O threads; 0: one more than the processors the process may use.
+        // I/O threads; 0: twice the processors the process may use, plus
+        // one. All but one may run requests inline, so with two per
+        // processor most requests do, while threads blocked in a request
+        // still leave others reading.
         size_t ioThreads = 0;
         // What one user other than root may hold; see RelayUserBudget.
         RelayUserLimits userLimits;

@@ -156,6 +156,11 @@ int lstatNoFollow(const std::filesystem::path& path, struct stat* st) {
     return ::fstatat(parent.get(), name.c_str(), st, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
 }
 
+int existsNoFollow(const std::filesystem::path& path) {
+    // An O_PATH open of a last link opens the link itself.
+    return openNoFollow(path, O_PATH) ? 0 : errno;
+}
+
 namespace {
 
 // `fd` if it is the item `expected` describes; else invalid, errno ESTALE.

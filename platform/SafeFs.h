@@ -45,6 +45,11 @@ UniqueFd openParentNoFollow(const std::filesystem::path& path, std::string* name
 // as the last component is described, not followed.
 int lstatNoFollow(const std::filesystem::path& path, struct stat* st);
 
+// 0 when an item (a link included, itself) is at `path`, reached without
+// following a link on the way; else the errno value, as lstatNoFollow()
+// gives it.
+int existsNoFollow(const std::filesystem::path& path);
+
 // Opens the directory `name` in `dirFd` for reading, provided it is still the
 // item `expected` (same device and inode). A link there, or a different item,
 // fails: ELOOP/ENOTDIR from the open, ESTALE for a different item.

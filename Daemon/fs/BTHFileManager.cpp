@@ -183,8 +183,7 @@ std::optional<std::vector<BTHFileURL>> BTHFileManager::urlsForItemsInDirectoryAt
 
 bool BTHFileManager::itemExistsAtURL(const std::filesystem::path& url) {
     BTH_FUNCTION("-[BTHFileManager itemExistsAtURL:]");
-    struct stat st;
-    const int err = fs::lstatNoFollow(url, &st);
+    const int err = fs::existsNoFollow(url);
     if (err != 0 && err != ENOENT)
         BTHLogError("Failed to determine if %@ exists: %s", url, errorText(err));
     return err == 0;
@@ -192,8 +191,7 @@ bool BTHFileManager::itemExistsAtURL(const std::filesystem::path& url) {
 
 bool BTHFileManager::itemDoesNotExistAtURL(const std::filesystem::path& url) {
     BTH_FUNCTION("-[BTHFileManager itemDoesNotExistAtURL:]");
-    struct stat st;
-    const int err = fs::lstatNoFollow(url, &st);
+    const int err = fs::existsNoFollow(url);
     if (err != 0 && err != ENOENT)
         BTHLogError("Failed to determine if %@ exists: %s", url, errorText(err));
     return err == ENOENT;

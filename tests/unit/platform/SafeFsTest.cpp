@@ -34,6 +34,9 @@ TEST(SafeFsTest, OpeningAndRenamingRefuseLinksInAnyComponent) {
     ASSERT_EQ(fs::lstatNoFollow(dir / "filelink", &st), 0);
     EXPECT_TRUE(S_ISLNK(st.st_mode));
     EXPECT_EQ(fs::lstatNoFollow(dir / "dirlink/target", &st), ELOOP);
+    EXPECT_EQ(fs::existsNoFollow(dir / "filelink"), 0);
+    EXPECT_EQ(fs::existsNoFollow(dir / "dirlink/target"), ELOOP);
+    EXPECT_EQ(fs::existsNoFollow(dir / "missing"), ENOENT);
     EXPECT_EQ(fs::renameNoFollow(dir / "filelink", dir / "renamed"), 0);
     EXPECT_TRUE(stdfs::is_symlink(dir / "renamed"));
     EXPECT_EQ(fs::renameNoFollow(dir / "dirlink/target", dir / "stolen"), ELOOP);
