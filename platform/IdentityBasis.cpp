@@ -1,5 +1,6 @@
 #include "platform/IdentityBasis.h"
 
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -10,10 +11,18 @@ namespace berth {
 
 namespace {
 
-std::optional<FileVersion> versionAt(const std::string& path, bool followLink) {
+// The version of what `path` (relative to `directory`) leads to, a last
+// link followed: the executable a /proc entry names.
+std::optional<FileVersion> versionAt(int directory, const std::string& path) {
     struct stat status {};
-    const int result = followLink ? ::stat(path.c_str(), &status) : ::lstat(path.c_str(), &status);
-    if (result != 0) return std::nullopt;
+    if (::fstatat(directory, path.c_str(), &status, 0) != 0) return std::nullopt;
+    return FileVersion::of(status);
+}
+
+// The version of the item at `path` itself.
+std::optional<FileVersion> itemVersionAt(const std::string& path) {
+    struct stat status {};
+    if (::lstat(path.c_str(), &status) != 0) return std::nullopt;
     return FileVersion::of(status);
 }
 
@@ -63,16 +72,26 @@ bool IdentityBasis::filesHold() {
     for (const auto& [path, version] : files_)
         if (watched && !watch_->watch(path)) watched = false;
     for (const auto& [path, version] : files_)
-        if (versionAt(path, false) != version) return false;
+        if (itemVersionAt(path) != version) return false;
     watched_ = watched;
     watchedSince_ = moment;
     return true;
 }
 
-bool IdentityBasis::holds(pid_t pid, int pidfd) {
+bool IdentityBasis::holds(pid_t pid, int pidfd, int procDirectory) {
+    if (procDirectory >= 0) {
+        // /proc is read last, through the process's own directory: what it
+        // shows is the process's, and a process that is gone shows nothing.
+        if (!filesHold()) return false;
+        if (!executable_ && !cgroup_)
+            return ::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;
+        std::string why;
+        return (!executable_ || versionAt(procDirectory, "exe") == executable_) &&
+               (!cgroup_ || cgroupShownIn(procDirectory, &why) == cgroup_);
+    }
     if (pid <= 0 || pidfd < 0) return false;
     const std::string proc = "/proc/" + std::to_string(pid);
-    if (executable_ && versionAt(proc + "/exe", true) != executable_) return false;
+    if (executable_ && versionAt(AT_FDCWD, proc + "/exe") != executable_) return false;
     if (!filesHold()) return false;
     if (cgroup_) {
         std::string why;

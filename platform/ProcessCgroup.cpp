@@ -35,8 +35,9 @@ bool endsWith(std::string_view text, std::string_view suffix) {
     return text.size() > suffix.size() && text.substr(text.size() - suffix.size()) == suffix;
 }
 
-std::optional<std::string> readSmallFile(const std::string& path, std::string* why) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+std::optional<std::string> readSmallFile(const std::string& path, std::string* why,
+                                         int directory = AT_FDCWD) {
+    UniqueFd fd(::openat(directory, path.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         *why = "cannot open " + path + ": " + strerror(errno);
         return std::nullopt;
@@ -111,6 +112,14 @@ std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why) {
     if (!text) return std::nullopt;
     std::optional<std::string> path = unifiedCgroupIn(*text);
     if (!path) *why = "process " + std::to_string(pid) + " is in no cgroup v2 group";
+    return path;
+}
+
+std::optional<std::string> cgroupShownIn(int procDirectory, std::string* why) {
+    const std::optional<std::string> text = readSmallFile("cgroup", why, procDirectory);
+    if (!text) return std::nullopt;
+    std::optional<std::string> path = unifiedCgroupIn(*text);
+    if (!path) *why = "the process is in no cgroup v2 group";
     return path;
 }
 

@@ -47,6 +47,11 @@ std::optional<std::string> cgroupOfProcess(pid_t pid, int pidfd, std::string* wh
 // that moment. The caller confirms the process afterwards.
 std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why);
 
+// The group shown in `procDirectory`, a /proc/<pid> directory opened while
+// the process lived: its own, since such a directory never shows a process
+// that took the number over (its entries vanish when the process goes).
+std::optional<std::string> cgroupShownIn(int procDirectory, std::string* why);
+
 // Whether `name` can name a unit whose processes may be bound to an
 // identity: a service or scope unit name of the service manager ("a.service",
 // "getty@tty1.service", "run-u7.scope"). The reason in `why`.

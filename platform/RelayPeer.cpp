@@ -80,7 +80,15 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
         return peer;
     }
     peer.pidfd_ = peerPidfd(fd, cred, &peer.unboundReason_);
-    if (!peer.pidfd_ || peer.uid_ != 0) return peer;
+    if (!peer.pidfd_) return peer;
+    // Opened before the pidfd is confirmed, so the directory is the peer's;
+    // without it, /proc is read by pid and the pidfd confirms each time.
+    peer.procDirectory_.reset(
+        ::open(("/proc/" + std::to_string(cred.pid)).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    std::string gone;
+    if (peer.procDirectory_ && !pidfdRefersTo(peer.pidfd_.get(), cred.pid, &gone))
+        peer.procDirectory_.reset();
+    if (peer.uid_ != 0) return peer;
     peer.bound_ = peer.signing_->executableOf(peer.pid_, peer.pidfd_.get(), &peer.unboundReason_);
     return peer;
 }
@@ -88,7 +96,8 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
 RelayPeerIdentity RelayPeer::identity() const {
     std::lock_guard lock(remembered_->mutex);
     std::optional<RelayPeerIdentity>& remembered = remembered_->identity;
-    if (remembered && remembered_->basis.holds(pid_, pidfd_.get())) return *remembered;
+    if (remembered && remembered_->basis.holds(pid_, pidfd_.get(), procDirectory_.get()))
+        return *remembered;
     IdentityBasis basis;
     RelayPeerIdentity evaluated = evaluate(&basis);
     if (evaluated.signingIdentifier && basis.settled()) {

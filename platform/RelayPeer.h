@@ -109,6 +109,8 @@ class RelayPeer {
     uid_t uid_ = 0;
     gid_t gid_ = 0;
     UniqueFd pidfd_;
+    // /proc/<pid>, opened while the peer lived: shows only that process.
+    UniqueFd procDirectory_;
     std::optional<ExecutableId> bound_;  // root's peers only
     std::string unboundReason_;          // why there is no identity to be had
     std::shared_ptr<CodeSigningService> signing_;
