@@ -12,6 +12,9 @@ namespace {
 
 constexpr int kLogError = 3;
 constexpr int kLogDebug = 7;
+// Requests of one peer run back to back on the thread that read the first,
+// at most, before the thread waits on the poller again.
+constexpr int kInlineTurns = 8;
 
 }  // namespace
 
@@ -147,26 +150,46 @@ void RelayConnection::ready(uint32_t events) {
         if (runHere) runningInline_ = true;
         updateInterestLocked(true);
     }
-    if (runHere) runInline(*runHere);
+    if (runHere) runInline(std::move(*runHere));
 }
 
-void RelayConnection::runInline(const RelayEvent& event) {
-    // Gives back the poller's place, then reads the socket again, even on a
-    // throw: the peer's next request then finds a free place and an idle
-    // queue, and runs inline too.
-    struct Rearm {
+void RelayConnection::runInline(RelayEvent event) {
+    // Gives back the poller's place (when held) and arms the socket for
+    // reading again, even on a throw.
+    struct Finish {
         RelayConnection& connection;
-        ~Rearm() {
-            connection.poller_->releaseInline();
+        bool holdsPlace = true;
+        ~Finish() {
+            if (holdsPlace) connection.poller_->releaseInline();
             Released released(connection);
             std::lock_guard lock(connection.mutex_);
             connection.runningInline_ = false;
+            connection.chargeLocked(released);
             connection.updateInterestLocked(true);
         }
-    } rearm{*this};
-    // Requests already buffered when this one ends run here too rather than
-    // being handed to a pool thread.
-    queue_->runClaimed([&] { deliver(event); }, true);
+    } finish{*this};
+    std::optional<RelayEvent> next(std::move(event));
+    for (int turn = 1;; ++turn) {
+        // Requests already buffered when this one ends run here too rather
+        // than being handed to a pool thread.
+        queue_->runClaimed([&] { deliver(*next); }, true);
+        poller_->releaseInline();
+        finish.holdsPlace = false;
+        next.reset();
+        if (turn == kInlineTurns || !readNextInline(&next)) return;
+        finish.holdsPlace = true;
+    }
+}
+
+bool RelayConnection::readNextInline(std::optional<RelayEvent>* next) {
+    Released released(*this);
+    std::lock_guard lock(mutex_);
+    // Only what the poller would read now: nothing while replies pile up.
+    if (closed_ || queued_ != 0 || pendingOutputLocked() > options_.limits.outputHighWater)
+        return false;
+    readLocked(released, next);
+    chargeLocked(released);
+    return next->has_value();
 }
 
 bool RelayConnection::claimInlineLocked() {
