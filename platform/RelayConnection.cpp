@@ -12,8 +12,8 @@ namespace {
 
 constexpr int kLogError = 3;
 constexpr int kLogDebug = 7;
-// Requests of one peer run back to back on the thread that read the first,
-// at most, before the thread waits on the poller again.
+// At most this many requests of one peer run back to back on the thread that
+// read the first, before it waits on the poller again.
 constexpr int kInlineTurns = 8;
 
 }  // namespace
