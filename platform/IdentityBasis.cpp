@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include "platform/ProcessCgroup.h"
+#include "platform/UniqueFd.h"
 
 namespace berth {
 
@@ -79,25 +80,25 @@ bool IdentityBasis::filesHold() {
 }
 
 bool IdentityBasis::holds(pid_t pid, int pidfd, int procDirectory) {
-    if (procDirectory >= 0) {
-        // /proc is read last, through the process's own directory: what it
-        // shows is the process's, and a process that is gone shows nothing.
-        if (!filesHold()) return false;
-        if (!executable_ && !cgroup_)
-            return ::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;
-        std::string why;
-        return (!executable_ || versionAt(procDirectory, "exe") == executable_) &&
-               (!cgroup_ || cgroupShownIn(procDirectory, &why) == cgroup_);
-    }
-    if (pid <= 0 || pidfd < 0) return false;
-    const std::string proc = "/proc/" + std::to_string(pid);
-    if (executable_ && versionAt(AT_FDCWD, proc + "/exe") != executable_) return false;
     if (!filesHold()) return false;
-    if (cgroup_) {
-        std::string why;
-        if (cgroupShownFor(pid, &why) != cgroup_) return false;
+    // /proc is read last. The process's own directory, opened while it
+    // lived, shows only that process and nothing once it is gone; one opened
+    // now by pid could show a process that took the number, so the pidfd
+    // confirms afterwards.
+    UniqueFd openedNow;
+    if (procDirectory < 0) {
+        if (pid <= 0 || pidfd < 0) return false;
+        openedNow.reset(
+            ::open(("/proc/" + std::to_string(pid)).c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+        if (!openedNow) return false;
+        procDirectory = openedNow.get();
     }
-    return ::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;
+    std::string why;
+    if (executable_ && versionAt(procDirectory, "exe") != executable_) return false;
+    if (cgroup_ && cgroupShownIn(procDirectory, &why) != cgroup_) return false;
+    if (openedNow || (!executable_ && !cgroup_))
+        return ::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;
+    return true;
 }
 
 }  // namespace berth

@@ -61,11 +61,12 @@ class IdentityBasis {
     void watchWith(std::shared_ptr<ChangeWatch> watch);
 
     // Whether everything recorded is still as it was, for the process `pid`
-    // that `pidfd` refers to. The process is confirmed alive last, so what
-    // /proc showed of `pid` was its own. With `procDirectory` (its /proc
-    // directory, opened while it lived) /proc is read through that, which
-    // shows nothing once the process is gone, and no other confirmation is
-    // needed. Not safe to call from two threads at once.
+    // that `pidfd` refers to; /proc is read last. With `procDirectory` (its
+    // /proc directory, opened while it lived) /proc is read through that,
+    // which shows nothing once the process is gone; without it, through
+    // /proc/<pid>, and the pidfd then confirms the process afterwards, so
+    // what /proc showed was its own. Not safe to call from two threads at
+    // once.
     bool holds(pid_t pid, int pidfd, int procDirectory = -1);
 
   private:

@@ -106,21 +106,28 @@ std::optional<std::string> cgroupOfProcess(pid_t pid, int pidfd, std::string* wh
     return path;
 }
 
-std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why) {
-    const std::optional<std::string> text =
-        readSmallFile("/proc/" + std::to_string(pid) + "/cgroup", why);
+namespace {
+
+// The unified group in the cgroup file at `path` (relative to `directory`),
+// of the process `subject` names in the reason when there is none.
+std::optional<std::string> cgroupInFile(int directory, const std::string& path,
+                                        const std::string& subject, std::string* why) {
+    const std::optional<std::string> text = readSmallFile(path, why, directory);
     if (!text) return std::nullopt;
-    std::optional<std::string> path = unifiedCgroupIn(*text);
-    if (!path) *why = "process " + std::to_string(pid) + " is in no cgroup v2 group";
-    return path;
+    std::optional<std::string> group = unifiedCgroupIn(*text);
+    if (!group) *why = subject + " is in no cgroup v2 group";
+    return group;
+}
+
+}  // namespace
+
+std::optional<std::string> cgroupShownFor(pid_t pid, std::string* why) {
+    return cgroupInFile(AT_FDCWD, "/proc/" + std::to_string(pid) + "/cgroup",
+                        "process " + std::to_string(pid), why);
 }
 
 std::optional<std::string> cgroupShownIn(int procDirectory, std::string* why) {
-    const std::optional<std::string> text = readSmallFile("cgroup", why, procDirectory);
-    if (!text) return std::nullopt;
-    std::optional<std::string> path = unifiedCgroupIn(*text);
-    if (!path) *why = "the process is in no cgroup v2 group";
-    return path;
+    return cgroupInFile(procDirectory, "cgroup", "the process", why);
 }
 
 bool isServiceUnitName(std::string_view name, std::string* why) {
