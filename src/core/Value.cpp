@@ -20,6 +20,19 @@ struct IntegerKey {
     uint64_t magnitudeBits;  // the value itself when non-negative, else the int64 bits
 };
 
+// Reals and dates compare as numbers, except that every NaN equals every
+// other: a value read back from a stored property list must equal the one
+// written, and a value used as a key must equal itself.
+bool sameNumber(double a, double b) {
+    return a == b || (std::isnan(a) && std::isnan(b));
+}
+
+// Agrees with sameNumber(): both zeros alike, all NaNs alike.
+size_t numberHash(double d) {
+    if (std::isnan(d)) return 0x7FF8;
+    return d == 0 ? 0 : std::hash<double>()(d);
+}
+
 IntegerKey integerKey(const Value& v) {
     if (v.kind() == Value::Kind::Int64) {
         int64_t i = *v.int64Value();
@@ -143,6 +156,10 @@ bool operator==(const Value& a, const Value& b) {
         IntegerKey x = integerKey(a), y = integerKey(b);
         return x.negative == y.negative && x.magnitudeBits == y.magnitudeBits;
     }
+    if (a.kind() == Value::Kind::Double && b.kind() == Value::Kind::Double)
+        return sameNumber(std::get<double>(a.storage_), std::get<double>(b.storage_));
+    if (a.kind() == Value::Kind::Date && b.kind() == Value::Kind::Date)
+        return sameNumber(a.date()->secondsSince1970, b.date()->secondsSince1970);
     return a.storage_ == b.storage_;
 }
 
@@ -159,8 +176,7 @@ size_t Value::hash() const {
             return mix(mix(seed, key.negative), std::hash<uint64_t>()(key.magnitudeBits));
         }
         case Kind::Double: {
-            double d = std::get<double>(storage_);
-            return mix(seed, d == 0 ? 0 : std::hash<double>()(d));
+            return mix(seed, numberHash(std::get<double>(storage_)));
         }
         case Kind::String:
             return mix(seed, std::hash<std::string>()(*string()));
@@ -168,7 +184,7 @@ size_t Value::hash() const {
             return mix(seed, std::hash<std::string_view>()(std::string_view(
                                  reinterpret_cast<const char*>(data()->data()), data()->size())));
         case Kind::Date:
-            return mix(seed, std::hash<double>()(date()->secondsSince1970));
+            return mix(seed, numberHash(date()->secondsSince1970));
         case Kind::Uuid:
             return mix(seed, std::hash<berth::Uuid>()(*uuid()));
         case Kind::Array:

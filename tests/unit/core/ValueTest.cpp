@@ -2,6 +2,7 @@
 
 #include <cmath>
 
+#include <limits>
 #include <unordered_set>
 
 #include "core/Uuid.h"
@@ -46,6 +47,34 @@ TEST(ValueTest, DeepEqualityAndHashOfTrees) {
     changed.set("Info", info);
     EXPECT_NE(a, changed);
     EXPECT_FALSE(set.count(changed));
+}
+
+// A stored mapping is compared with what was written: a NaN anywhere in it
+// (a real or a date) must not make a value unequal to itself or to its copy
+// read back, and equal values must hash alike (zeros of either sign too).
+TEST(ValueTest, NaNsAndSignedZerosCompareAndHashAsTheSameNumber) {
+    const double nan = std::numeric_limits<double>::quiet_NaN();
+    for (const Value& v : {Value(nan), Value(Value::Date{nan})}) {
+        EXPECT_EQ(v, v);
+        EXPECT_EQ(v.hash(), Value(v).hash());
+    }
+    EXPECT_EQ(Value(nan), Value(-nan));
+    EXPECT_EQ(Value(nan).hash(), Value(-nan).hash());
+    EXPECT_EQ(Value(0.0), Value(-0.0));
+    EXPECT_EQ(Value(0.0).hash(), Value(-0.0).hash());
+    EXPECT_EQ(Value(Value::Date{0.0}).hash(), Value(Value::Date{-0.0}).hash());
+    EXPECT_NE(Value(nan), Value(0.0));
+    EXPECT_NE(Value(Value::Date{nan}), Value(nan));
+
+    Value tree = sampleTree();
+    tree.set("When", Value(Value::Date{nan}));
+    Value list = Value::array();
+    list.push(Value(nan));
+    tree.set("List", list);
+    Value copy = tree;
+    EXPECT_EQ(tree, copy);
+    std::unordered_set<Value> set{tree};
+    EXPECT_TRUE(set.count(copy));
 }
 
 TEST(ValueTest, TypedViewsAnswerOnlyForTheirKind) {
