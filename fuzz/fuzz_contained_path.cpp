@@ -8,6 +8,7 @@
 // makes one item of the tree, relative to its top (which holds "base" and
 // "outside"): "d NAME" a directory, "f NAME" a file, "l NAME TEXT" a link.
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstddef>
@@ -17,6 +18,7 @@
 #include <fstream>
 #include <sstream>
 #include <string>
+#include <vector>
 
 #include "BTHFileManager.h"
 #include "BTHLog.h"
@@ -27,48 +29,75 @@ namespace fs = std::filesystem;
 
 constexpr size_t kMaxItems = 24;
 
+// A scratch tree the input describes. It is built through descriptors, one
+// name at a time, and never through a link: a link the input plants (say to
+// "/") would otherwise carry later items out of the tree and onto the host.
 class ScratchTree {
   public:
     ScratchTree() {
         std::string templ = (fs::temp_directory_path() / "berth-fuzz-contained.XXXXXX").string();
         if (!mkdtemp(templ.data())) std::abort();
         top_ = fs::canonical(templ);
+        topFd_ = ::open(top_.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+        if (topFd_ < 0) std::abort();
     }
     ~ScratchTree() {
+        ::close(topFd_);
         std::error_code ignored;
         fs::remove_all(top_, ignored);
     }
 
-    // A fresh tree: empty "base" and "outside" with a secret.
+    // A fresh tree: empty "base" and "outside" with a secret, nothing else
+    // left from an earlier input. (Removal never follows links.)
     void reset() {
         std::error_code ignored;
-        fs::remove_all(top_ / "base", ignored);
-        fs::remove_all(top_ / "outside", ignored);
+        for (const auto& entry : fs::directory_iterator(top_, ignored))
+            fs::remove_all(entry.path(), ignored);
         fs::create_directories(top_ / "base");
         fs::create_directories(top_ / "outside");
         std::ofstream(top_ / "outside/secret") << "secret";
     }
 
-    // Makes one item; names that climb or are absolute are skipped, so the
-    // tree itself never reaches beyond its top.
+    // Makes one item; names that climb or are absolute are skipped, and so
+    // is an item whose way down meets a link or a file.
     void make(char kind, const std::string& name, const std::string& text) {
         const fs::path relative(name);
-        if (name.empty() || relative.is_absolute()) return;
-        for (const auto& part : relative)
+        if (name.empty() || relative.is_absolute() || text.find('\0') != std::string::npos) return;
+        std::vector<std::string> parts;
+        for (const auto& part : relative) {
             if (part == "..") return;
-        const fs::path item = top_ / relative;
-        std::error_code ignored;
-        fs::create_directories(item.parent_path(), ignored);
-        if (kind == 'd') fs::create_directories(item, ignored);
-        if (kind == 'f') std::ofstream(item) << "item";
-        if (kind == 'l') fs::create_symlink(text, item, ignored);
+            if (!part.empty() && part != ".") parts.push_back(part.string());
+        }
+        if (parts.empty()) return;
+        const std::string last = parts.back();
+        parts.pop_back();
+        int dir = ::dup(topFd_);
+        for (const std::string& part : parts) {
+            ::mkdirat(dir, part.c_str(), 0755);
+            const int next =
+                ::openat(dir, part.c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+            ::close(dir);
+            if (next < 0) return;
+            dir = next;
+        }
+        if (kind == 'd') ::mkdirat(dir, last.c_str(), 0755);
+        if (kind == 'l') ::symlinkat(text.c_str(), dir, last.c_str());
+        if (kind == 'f') {
+            const int file = ::openat(dir, last.c_str(),
+                                      O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
+            if (file >= 0) {
+                (void)!::write(file, "item", 4);
+                ::close(file);
+            }
+        }
+        ::close(dir);
     }
 
-    const fs::path& top() const { return top_; }
     fs::path base() const { return top_ / "base"; }
 
   private:
     fs::path top_;
+    int topFd_ = -1;
 };
 
 bool inside(const std::string& path, const std::string& base) {
