@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 namespace berth {
 namespace {
@@ -57,6 +58,11 @@ RelayConnection::RelayConnection(Passkey, UniqueFd socket, RelayPeer peer,
       queue_(WorkQueue::makeSerial(options_.label)),
       socket_(std::move(socket)) {
     if (options_.target) queue_->setTarget(options_.target);
+    // With a peek offset, a peek returns only bytes not looked at before, so
+    // requests that follow one another can all be looked at before any is
+    // taken.
+    const int start = 0;
+    peekOffset_ = ::setsockopt(socket_.get(), SOL_SOCKET, SO_PEEK_OFF, &start, sizeof start) == 0;
     // Events wait until the owner has set its handler and resumed.
     queue_->suspend();
 }
@@ -164,6 +170,7 @@ void RelayConnection::runInline(RelayEvent event) {
             Released released(connection);
             std::lock_guard lock(connection.mutex_);
             connection.runningInline_ = false;
+            connection.takePeekedLocked(released);
             connection.chargeLocked(released);
             connection.updateInterestLocked(true);
         }
@@ -203,16 +210,51 @@ void RelayConnection::readLocked(Released& released, std::optional<RelayEvent>* 
     // Reads happen on the poller's threads only; one buffer per thread
     // serves them all.
     thread_local std::vector<uint8_t> chunk;
-    if (chunk.size() < options_.limits.readChunk) chunk.resize(options_.limits.readChunk);
-    const ssize_t count = ::read(socket_.get(), chunk.data(), options_.limits.readChunk);
+    const size_t wanted = peeked_ + options_.limits.readChunk;
+    if (chunk.size() < wanted) chunk.resize(wanted);
+    // A request that may run here is only looked at (see peeked_). Past
+    // bytes already looked at only with a peek offset.
+    const bool peek = runHere && queued_ == 0 && (peeked_ == 0 || peekOffset_);
+    size_t skip = 0;  // bytes of this read the decoder already has
+    ssize_t count;
+    if (peek) {
+        count =
+            ::recv(socket_.get(), chunk.data(), options_.limits.readChunk, MSG_PEEK | MSG_DONTWAIT);
+        if (count > 0) peeked_ += static_cast<size_t>(count);
+    } else {
+        for (;;) {
+            count = ::read(socket_.get(), chunk.data(), wanted);
+            if (count <= 0 || static_cast<size_t>(count) >= peeked_) break;
+            // The kernel returns the bytes of one sender at a time.
+            peeked_ -= static_cast<size_t>(count);
+        }
+        if (count > 0) skip = std::exchange(peeked_, 0);
+    }
     if (count == 0) {
         closeLocked(kLogDebug, "the peer closed the connection", released);
     } else if (count < 0) {
         if (errno != EAGAIN && errno != EINTR)
             closeLocked(kLogDebug, std::string("read failed: ") + strerror(errno), released);
-    } else {
-        decoder_.feed(std::span<const uint8_t>(chunk.data(), static_cast<size_t>(count)));
+    } else if (static_cast<size_t>(count) > skip) {
+        decoder_.feed(
+            std::span<const uint8_t>(chunk.data() + skip, static_cast<size_t>(count) - skip));
         pumpLocked(released, runHere);
+        // Unless a request runs here, what was looked at is taken at once.
+        if (peek && !(runHere && *runHere)) takePeekedLocked(released);
+    }
+}
+
+void RelayConnection::takePeekedLocked(Released& released) {
+    thread_local std::vector<uint8_t> scratch;
+    while (peeked_ > 0 && !closed_) {
+        if (scratch.size() < peeked_) scratch.resize(peeked_);
+        const ssize_t count = ::read(socket_.get(), scratch.data(), peeked_);
+        if (count < 0 && errno == EINTR) continue;
+        if (count <= 0) {
+            closeLocked(kLogDebug, "the bytes of a request went missing", released);
+            return;
+        }
+        peeked_ -= static_cast<size_t>(count);
     }
 }
 
@@ -302,6 +344,7 @@ void RelayConnection::closeLocked(int level, const std::string& reason, Released
     token_ = 0;
     socket_.reset();
     decoder_ = relay::FrameDecoder();
+    peeked_ = 0;
     output_ = {};
     outputStart_ = 0;
     dispatchLocked(RelayEvent::connectionInvalid(shared_from_this()));

@@ -216,6 +216,8 @@ class RelayConnection final : public RelayPoller::Watcher,
     // has a place for it and the queue could be claimed.
     void pumpLocked(Released& released, std::optional<RelayEvent>* runHere = nullptr);
     bool claimInlineLocked();
+    // Takes off the socket the bytes a peek left there (see peeked_).
+    void takePeekedLocked(Released& released);
     // Runs an event pumpLocked() left for inline running, then gives back
     // the claim and the poller's place. The peer's next request, when it has
     // already arrived, is read and run here as well (a few times at most):
@@ -256,7 +258,15 @@ class RelayConnection final : public RelayPoller::Watcher,
     bool runningInline_ = false;
     EventHandler handler_;
     relay::FrameDecoder decoder_;
-    size_t queued_ = 0;  // requests dispatched and not yet handled
+    // Bytes the decoder has that are still in the socket: a request that
+    // runs on the thread that read it is only peeked at, and its bytes are
+    // taken once it has been answered (by the next read, or when the run
+    // ends). Taking them frees the peer's sending space, and the kernel
+    // then wakes the peer - asleep waiting for its reply - for nothing:
+    // that wake-up and the switches it costs would come with every request.
+    size_t peeked_ = 0;
+    bool peekOffset_ = false;  // the socket's peek offset is on
+    size_t queued_ = 0;        // requests dispatched and not yet handled
     std::vector<uint8_t> output_;
     size_t outputStart_ = 0;  // first byte of output_ not yet written
     size_t charged_ = 0;      // bytes charged to the user's budget

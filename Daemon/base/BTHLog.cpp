@@ -17,6 +17,14 @@ std::atomic<std::shared_ptr<BTHLogHandle>>& handleSlot() {
     return slot;
 }
 
+// The installed handle's threshold (notice without one), kept apart so that
+// asking whether a level is logged, as hot paths do for every debug line,
+// touches no shared reference count.
+std::atomic<int>& effectiveThreshold() {
+    static std::atomic<int> threshold{BTHLogLevelNotice};
+    return threshold;
+}
+
 std::string composeLine(int level, std::string_view function, std::string_view message);
 
 thread_local const BTHLogIdentifierScope* tCurrentScope = nullptr;
@@ -144,13 +152,17 @@ void BTHSetLogFileCount(uint32_t count) {
 }
 
 void BTHLogSetHandle(std::shared_ptr<BTHLogHandle> handle) {
+    effectiveThreshold().store(handle ? handle->threshold() : int{BTHLogLevelNotice});
     handleSlot().store(std::move(handle));
 }
 
+void BTHLogHandle::setThreshold(int threshold) {
+    threshold_ = threshold;
+    if (BTHLogGetHandle().get() == this) effectiveThreshold().store(threshold);
+}
+
 bool BTHLogEnabled(int level) {
-    std::shared_ptr<BTHLogHandle> handle = BTHLogGetHandle();
-    if (!handle) return level <= BTHLogLevelNotice;
-    return handle->threshold() >= level;
+    return effectiveThreshold().load(std::memory_order_relaxed) >= level;
 }
 
 void BTHLogWrite(int level, std::string_view function, std::string_view message) {

@@ -60,7 +60,8 @@ class BTHLogHandle {
     void addSink(spdlog::sink_ptr sink);
 
     int threshold() const { return threshold_; }
-    void setThreshold(int threshold) { threshold_ = threshold; }
+    // Takes effect at once when this is the installed handle.
+    void setThreshold(int threshold);
 
     void write(int level, std::string_view function, std::string_view message);
 

@@ -2,7 +2,9 @@
 // of delivery, parallel peers, peers that leave, broken and flooding peers,
 // and many peers at once.
 #include <fcntl.h>
+#include <linux/sockios.h>
 #include <poll.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 
 #include <future>
@@ -69,6 +71,49 @@ TEST(RelayTest, PipelinedRequestsAreHandledAndAnsweredInOrder) {
         EXPECT_EQ(numberAt(replies[seq].body, "Seq"), seq);
         EXPECT_EQ(numberAt(replies[seq].body, "Arrival"), seq);
     }
+}
+
+// A request run where it was read stays in the peer's socket until it is
+// answered: taking it earlier wakes the peer, asleep waiting for its reply,
+// for nothing. Once answered it is taken, and the next one is served.
+TEST(RelayTest, ARequestRunWhereItWasReadIsTakenOffTheSocketOnceAnswered) {
+    test::Event release, running;
+    RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
+        if (event.message().find("Block")) running.set(), release.wait(10min);
+        reply.body().set("Seq", numberAt(event.message(), "Seq"));
+    });
+    UniqueFd client = server.connectRaw();
+    auto unread = [&] {
+        int bytes = -1;
+        EXPECT_EQ(::ioctl(client.get(), SIOCOUTQ, &bytes), 0);
+        return bytes;
+    };
+    // One exchange first: a request that arrives while the connection is
+    // still being set up is handed to its queue instead.
+    ASSERT_TRUE(test::writeAll(client.get(),
+                               test::frameBytes(relay::FrameKind::Request, 0, dict({{"Seq", 0}}))));
+    ASSERT_EQ(test::readFrames(client.get(), 1).size(), 1u);
+    const auto first =
+        test::frameBytes(relay::FrameKind::Request, 1, dict({{"Block", true}, {"Seq", 1}}));
+    ASSERT_TRUE(test::writeAll(client.get(), first));
+    ASSERT_TRUE(running.wait());
+    // (The kernel counts what the bytes occupy, not the bytes.)
+    EXPECT_GT(unread(), 0);
+    release.set();
+    std::vector<relay::Frame> replies = test::readFrames(client.get(), 1);
+    ASSERT_EQ(replies.size(), 1u);
+    EXPECT_EQ(numberAt(replies[0].body, "Seq"), 1u);
+    const auto deadline = std::chrono::steady_clock::now() + 20s;
+    while (unread() != 0 && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(1ms);
+    EXPECT_EQ(unread(), 0);
+
+    ASSERT_TRUE(test::writeAll(client.get(),
+                               test::frameBytes(relay::FrameKind::Request, 2, dict({{"Seq", 2}}))));
+    replies = test::readFrames(client.get(), 1);
+    ASSERT_EQ(replies.size(), 1u);
+    EXPECT_EQ(replies[0].messageId, 2u);
+    EXPECT_EQ(numberAt(replies[0].body, "Seq"), 2u);
 }
 
 TEST(RelayTest, ThreadsSharingAClientConnectionEachGetTheirOwnReply) {
