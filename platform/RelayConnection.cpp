@@ -169,8 +169,10 @@ void RelayConnection::runInline(RelayEvent event) {
             if (holdsPlace) connection.poller_->releaseInline();
             Released released(connection);
             std::lock_guard lock(connection.mutex_);
-            connection.runningInline_ = false;
-            connection.takePeekedLocked(released);
+            // A request of the peer parked by the last read still counts
+            // as running here.
+            connection.runningInline_ = connection.parked_.has_value();
+            if (!connection.runningInline_) connection.takePeekedLocked(released);
             connection.chargeLocked(released);
             connection.updateInterestLocked(true);
         }
@@ -186,6 +188,39 @@ void RelayConnection::runInline(RelayEvent event) {
         if (turn == kInlineTurns || !readNextInline(&next)) return;
         finish.holdsPlace = true;
     }
+}
+
+void RelayConnection::runParked() {
+    std::optional<RelayEvent> event;
+    {
+        std::lock_guard lock(mutex_);
+        event = std::exchange(parked_, std::nullopt);
+    }
+    if (event)
+        runInline(std::move(*event));
+    else
+        poller_->releaseInline();
+}
+
+void RelayConnection::unpark() {
+    std::optional<RelayEvent> event;
+    {
+        Released released(*this);
+        std::lock_guard lock(mutex_);
+        event = std::exchange(parked_, std::nullopt);
+        if (!event) return;
+        runningInline_ = false;
+        takePeekedLocked(released);
+        chargeLocked(released);
+        updateInterestLocked(true);
+    }
+    // Still claimed since it was parked: the request runs first, then what
+    // the queue received meanwhile.
+    const std::shared_ptr<WorkQueue>& pool =
+        options_.target ? options_.target : WorkQueue::global(QueuePriority::normal);
+    pool->async([self = shared_from_this(), event = std::move(*event)] {
+        self->queue_->runClaimed([&] { self->deliver(event); }, true);
+    });
 }
 
 bool RelayConnection::readNextInline(std::optional<RelayEvent>* next) {
@@ -240,7 +275,7 @@ void RelayConnection::readLocked(Released& released, std::optional<RelayEvent>* 
             std::span<const uint8_t>(chunk.data() + skip, static_cast<size_t>(count) - skip));
         pumpLocked(released, runHere);
         // Unless a request runs here, what was looked at is taken at once.
-        if (peek && !(runHere && *runHere)) takePeekedLocked(released);
+        if (peek && !(runHere && *runHere) && !parked_) takePeekedLocked(released);
     }
 }
 
@@ -274,12 +309,21 @@ void RelayConnection::pumpLocked(Released& released, std::optional<RelayEvent>* 
             return;
         }
         RelayEvent event = RelayEvent::message(shared_from_this(), std::move(frame));
-        const bool runsHere = runHere && !*runHere && claimInlineLocked();
+        const bool mayRunHere = runHere && !*runHere && !parked_;
+        const bool runsHere = mayRunHere && claimInlineLocked();
+        // With every inline place taken, the request waits for the next
+        // thread that finishes one rather than going to the pool at once.
+        const bool parks = mayRunHere && !runsHere && queued_ == 0 && queue_->tryClaim();
         ++queued_;
-        if (runsHere)
+        if (runsHere) {
             runHere->emplace(std::move(event));
-        else
+        } else if (parks) {
+            parked_.emplace(std::move(event));
+            runningInline_ = true;
+            poller_->park(shared_from_this());
+        } else {
             dispatchLocked(std::move(event));
+        }
     }
 }
 

@@ -8,7 +8,10 @@
 // queue is idle and the poller has a place for inline work, the I/O thread
 // that read a request runs it itself, as the queue's own item (claimed, so
 // later events of the peer wait for it): the same order and the same one at
-// a time, without a hop to another thread. When the
+// a time, without a hop to another thread. With every inline place taken,
+// such a request waits parked, its queue claimed the same way, for the next
+// I/O thread that finishes its own, and goes to the pool only when none has
+// within RelayPoller::kParkedWait. When the
 // connection ends - the peer hung up, broke the protocol, flooded it, or
 // the connection was cancelled - the handler gets one last event,
 // ConnectionInvalid, after every event delivered before; then the
@@ -187,6 +190,8 @@ class RelayConnection final : public RelayPoller::Watcher,
 
     // Called by the poller.
     void ready(uint32_t events) override;
+    void runParked() override;
+    void unpark() override;
 
   private:
     // What a locked section leaves to be done once the lock is let go: the
@@ -256,6 +261,9 @@ class RelayConnection final : public RelayPoller::Watcher,
     // meanwhile, so the peer's next request does not reach another thread
     // only to wait for this one.
     bool runningInline_ = false;
+    // A request waiting, with the queue claimed for it, for a thread with an
+    // inline place (see RelayPoller::park); runningInline_ is set meanwhile.
+    std::optional<RelayEvent> parked_;
     EventHandler handler_;
     relay::FrameDecoder decoder_;
     // Bytes the decoder has that are still in the socket: a request that

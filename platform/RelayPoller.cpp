@@ -111,9 +111,60 @@ void RelayPoller::stop() {
             (void)!::write(wake_.get(), &one, sizeof one);
         }
     }
-    std::lock_guard join(joinMutex_);
-    for (std::thread& thread : threads_)
-        if (thread.joinable() && thread.get_id() != std::this_thread::get_id()) thread.join();
+    {
+        std::lock_guard join(joinMutex_);
+        for (std::thread& thread : threads_)
+            if (thread.joinable() && thread.get_id() != std::this_thread::get_id()) thread.join();
+    }
+    // Nobody is left to run parked work here.
+    std::deque<Parked> parked;
+    {
+        std::lock_guard lock(parkMutex_);
+        parked.swap(parked_);
+        parkedCount_.store(0, std::memory_order_relaxed);
+    }
+    for (Parked& item : parked) item.watcher->unpark();
+}
+
+void RelayPoller::park(std::shared_ptr<Watcher> watcher) {
+    std::lock_guard lock(parkMutex_);
+    parked_.push_back({std::move(watcher), std::chrono::steady_clock::now() + kParkedWait});
+    parkedCount_.store(parked_.size(), std::memory_order_relaxed);
+}
+
+int RelayPoller::parkedTimeout() {
+    if (parkedCount_.load(std::memory_order_relaxed) == 0) return -1;
+    std::lock_guard lock(parkMutex_);
+    if (parked_.empty()) return -1;
+    const auto left = parked_.front().deadline - std::chrono::steady_clock::now();
+    const auto ms = std::chrono::ceil<std::chrono::milliseconds>(left).count();
+    return ms > 0 ? static_cast<int>(ms) : 0;
+}
+
+std::shared_ptr<RelayPoller::Watcher> RelayPoller::takeParked(bool expiredOnly) {
+    std::lock_guard lock(parkMutex_);
+    if (parked_.empty() ||
+        (expiredOnly && parked_.front().deadline > std::chrono::steady_clock::now()))
+        return nullptr;
+    std::shared_ptr<Watcher> watcher = std::move(parked_.front().watcher);
+    parked_.pop_front();
+    parkedCount_.store(parked_.size(), std::memory_order_relaxed);
+    return watcher;
+}
+
+void RelayPoller::serveParked() {
+    // Parked work is only ever added by these threads, which all pass here
+    // after each event: a stale zero is seen again at the next pass.
+    if (parkedCount_.load(std::memory_order_relaxed) == 0) return;
+    while (reserveInline()) {
+        std::shared_ptr<Watcher> watcher = takeParked(false);
+        if (!watcher) {
+            releaseInline();
+            break;
+        }
+        watcher->runParked();
+    }
+    while (std::shared_ptr<Watcher> watcher = takeParked(true)) watcher->unpark();
 }
 
 void RelayPoller::run() {
@@ -123,7 +174,7 @@ void RelayPoller::run() {
     // for other peers.
     const int perWait = threads_.size() > 1 ? 1 : kEventsPerWait;
     for (;;) {
-        const int count = ::epoll_wait(epoll_.get(), events, perWait, -1);
+        const int count = ::epoll_wait(epoll_.get(), events, perWait, parkedTimeout());
         if (count < 0 && errno != EINTR) return;
         for (int i = 0; i < count; ++i) {
             std::shared_ptr<Watcher> watcher;
@@ -137,6 +188,7 @@ void RelayPoller::run() {
             }
             watcher->ready(events[i].events);
         }
+        serveParked();
         std::lock_guard lock(mutex_);
         if (stopping_) return;
     }

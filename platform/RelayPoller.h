@@ -11,13 +11,19 @@
 // A request may run on the thread that read it, sparing a hop to another
 // thread, but only while another thread is left waiting: at most all threads
 // but one run such inline work at a time (reserveInline), so a request that
-// blocks never stops the reading of other peers.
+// blocks never stops the reading of other peers. A request read while every
+// place is taken may wait parked (park) for the next thread that finishes
+// its inline work - a thread already running, so nobody is woken - but not
+// longer than kParkedWait: then it goes to the pool (the watcher's
+// unpark()).
 #pragma once
 
 #include <sys/epoll.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
+#include <deque>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -41,6 +47,12 @@ class RelayPoller {
         virtual ~Watcher() = default;
         // `events` is the epoll event mask that became ready.
         virtual void ready(uint32_t events) = 0;
+        // Runs the work the watcher parked; the caller took an inline place
+        // for it, which the watcher gives back.
+        virtual void runParked() {}
+        // The parked work found no place in time (or the poller stops): it
+        // is to run elsewhere.
+        virtual void unpark() {}
     };
 
     // A poller with `threads` threads running (at least one), or null with
@@ -79,8 +91,28 @@ class RelayPoller {
     bool reserveInline();
     void releaseInline();
 
+    // How long parked work waits for an inline place at most.
+    static constexpr std::chrono::milliseconds kParkedWait{1};
+
+    // Parks `watcher`'s work until a thread finishing inline work has a
+    // place for it (runParked) or kParkedWait has passed (unpark). Call it
+    // from a poller thread, as part of ready().
+    void park(std::shared_ptr<Watcher> watcher);
+
   private:
+    struct Parked {
+        std::shared_ptr<Watcher> watcher;
+        std::chrono::steady_clock::time_point deadline;
+    };
+
     void run();
+    // The epoll timeout that wakes a waiting thread when the oldest parked
+    // work's time is up; -1 with nothing parked.
+    int parkedTimeout();
+    // Runs parked work while places are free, then sends work whose time is
+    // up elsewhere.
+    void serveParked();
+    std::shared_ptr<Watcher> takeParked(bool expiredOnly);
 
     UniqueFd epoll_;
     UniqueFd wake_;          // eventfd that ends the threads
@@ -92,6 +124,9 @@ class RelayPoller {
     std::unordered_map<uint64_t, std::shared_ptr<Watcher>> watchers_;
     uint64_t nextToken_ = 1;
     bool stopping_ = false;
+    std::mutex parkMutex_;  // never held while calling a watcher
+    std::deque<Parked> parked_;
+    std::atomic<size_t> parkedCount_{0};  // parked_.size(), read without the lock
 };
 
 }  // namespace berth
