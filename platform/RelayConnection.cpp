@@ -313,7 +313,8 @@ void RelayConnection::pumpLocked(Released& released, std::optional<RelayEvent>* 
         const bool runsHere = mayRunHere && claimInlineLocked();
         // With every inline place taken, the request waits for the next
         // thread that finishes one rather than going to the pool at once.
-        const bool parks = mayRunHere && !runsHere && queued_ == 0 && queue_->tryClaim();
+        const bool parks = mayRunHere && !runsHere && queued_ == 0 && poller_->hasInlinePlaces() &&
+                           queue_->tryClaim();
         ++queued_;
         if (runsHere) {
             runHere->emplace(std::move(event));

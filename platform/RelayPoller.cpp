@@ -31,6 +31,7 @@ std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, s
     }
     threads = std::max<size_t>(threads, 1);
     poller->inlinePlaces_ = threads - 1;
+    poller->inlineCapacity_ = threads - 1;
     // Each thread holds the poller until it ends, so a watcher that drops
     // the last other reference from inside ready() cannot free the loop
     // under its feet. No thread runs before all are in the vector.

@@ -94,9 +94,14 @@ class RelayPoller {
     // How long parked work waits for an inline place at most.
     static constexpr std::chrono::milliseconds kParkedWait{1};
 
+    // True when work can run inline at all (more than one thread), and so
+    // may be parked.
+    bool hasInlinePlaces() const { return inlineCapacity_ > 0; }
+
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked) or kParkedWait has passed (unpark). Call it
-    // from a poller thread, as part of ready().
+    // from a poller thread, as part of ready(), and only when
+    // hasInlinePlaces().
     void park(std::shared_ptr<Watcher> watcher);
 
   private:
@@ -120,6 +125,7 @@ class RelayPoller {
     std::mutex joinMutex_;
     std::vector<std::thread> threads_;  // set by start(), then only joined
     std::atomic<size_t> inlinePlaces_{0};
+    size_t inlineCapacity_ = 0;  // set by start()
     std::mutex mutex_;
     std::unordered_map<uint64_t, std::shared_ptr<Watcher>> watchers_;
     uint64_t nextToken_ = 1;
