@@ -247,12 +247,9 @@ void RelayConnection::readLocked(Released& released, std::optional<RelayEvent>* 
     thread_local std::vector<uint8_t> chunk;
     const size_t wanted = peeked_ + options_.limits.readChunk;
     if (chunk.size() < wanted) chunk.resize(wanted);
-    // A request that may run here is only looked at (see peeked_) while
-    // other requests run: on an otherwise idle daemon the peer's early
-    // wake-up costs nothing, and brings its processor out of idle before the
-    // reply comes. Past bytes already looked at only with a peek offset.
-    const bool peek = runHere && queued_ == 0 && (peeked_ == 0 || peekOffset_) &&
-                      (peeked_ > 0 || poller_->runsInlineWork());
+    // A request that may run here is only looked at (see peeked_). Past
+    // bytes already looked at only with a peek offset.
+    const bool peek = runHere && queued_ == 0 && (peeked_ == 0 || peekOffset_);
     size_t skip = 0;  // bytes of this read the decoder already has
     ssize_t count;
     if (peek) {

@@ -97,10 +97,6 @@ class RelayPoller {
     // True when work can run inline at all (more than one thread), and so
     // may be parked.
     bool hasInlinePlaces() const { return inlineCapacity_ > 0; }
-    // True while another thread runs inline work.
-    bool runsInlineWork() const {
-        return inlinePlaces_.load(std::memory_order_relaxed) < inlineCapacity_;
-    }
 
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked) or kParkedWait has passed (unpark). Call it
