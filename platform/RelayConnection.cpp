@@ -247,9 +247,13 @@ void RelayConnection::readLocked(Released& released, std::optional<RelayEvent>* 
     thread_local std::vector<uint8_t> chunk;
     const size_t wanted = peeked_ + options_.limits.readChunk;
     if (chunk.size() < wanted) chunk.resize(wanted);
-    // A request that may run here is only looked at (see peeked_). Past
-    // bytes already looked at only with a peek offset.
-    const bool peek = runHere && queued_ == 0 && (peeked_ == 0 || peekOffset_);
+    // A request that may run here is only looked at (see peeked_), and only
+    // while other requests are being handled: on an otherwise idle relay the
+    // peer's early wake-up costs nothing, and brings its processor out of
+    // idle before the reply comes. Past bytes already looked at only with a
+    // peek offset.
+    const bool peek = runHere && queued_ == 0 && (peeked_ == 0 || peekOffset_) &&
+                      (peeked_ > 0 || poller_->busy());
     size_t skip = 0;  // bytes of this read the decoder already has
     ssize_t count;
     if (peek) {
@@ -407,7 +411,12 @@ void RelayConnection::deliver(const RelayEvent& event) {
         // dropped: nobody is left to read its reply.
         if (!closed_ || event.isConnectionInvalid()) handler = handler_;
     }
-    if (handler) handler(event);
+    if (handler && event.isConnectionInvalid()) {
+        handler(event);
+    } else if (handler) {
+        RelayPoller::Handling handling(*poller_);
+        handler(event);
+    }
 
     Released released(*this);
     EventHandler last;  // dropped after the lock is let go

@@ -98,6 +98,23 @@ class RelayPoller {
     // may be parked.
     bool hasInlinePlaces() const { return inlineCapacity_ > 0; }
 
+    // Counts a request of this poller's peers as being handled for as long
+    // as it lives, wherever the request runs (inline, parked or in a pool).
+    class Handling {
+      public:
+        explicit Handling(RelayPoller& poller) : poller_(poller) {
+            poller_.handling_.fetch_add(1, std::memory_order_relaxed);
+        }
+        ~Handling() { poller_.handling_.fetch_sub(1, std::memory_order_relaxed); }
+        Handling(const Handling&) = delete;
+        Handling& operator=(const Handling&) = delete;
+
+      private:
+        RelayPoller& poller_;
+    };
+    // True while any request is being handled.
+    bool busy() const { return handling_.load(std::memory_order_relaxed) > 0; }
+
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked) or kParkedWait has passed (unpark). Call it
     // from a poller thread, as part of ready(), and only when
@@ -126,6 +143,7 @@ class RelayPoller {
     std::vector<std::thread> threads_;  // set by start(), then only joined
     std::atomic<size_t> inlinePlaces_{0};
     size_t inlineCapacity_ = 0;  // set by start()
+    std::atomic<size_t> handling_{0};
     std::mutex mutex_;
     std::unordered_map<uint64_t, std::shared_ptr<Watcher>> watchers_;
     uint64_t nextToken_ = 1;
