@@ -24,10 +24,19 @@ namespace {
 namespace fs = std::filesystem;
 using namespace berth;
 
-fs::path makeScratchRoot() {
-    std::string templ = (fs::temp_directory_path() / "berth-fuzz-codesign.XXXXXX").string();
-    if (!mkdtemp(templ.data())) std::abort();
-    return templ;
+const fs::path& scratchRoot() {
+    static const fs::path root = [] {
+        std::string templ = (fs::temp_directory_path() / "berth-fuzz-codesign.XXXXXX").string();
+        if (!mkdtemp(templ.data())) std::abort();
+        return fs::path(templ);
+    }();
+    return root;
+}
+
+// Registered before the store is made, so it runs after the store is gone.
+void removeScratchRoot() {
+    std::error_code ignored;
+    fs::remove_all(scratchRoot(), ignored);
 }
 
 // The store under test, with the group manager connected as at start-up.
@@ -55,8 +64,8 @@ void checkGroups(const std::optional<std::vector<std::string>>& groups) {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    static const fs::path root = makeScratchRoot();
-    ::setenv("BERTH_ROOT", root.c_str(), 1);
+    ::setenv("BERTH_ROOT", scratchRoot().c_str(), 1);
+    std::atexit(removeScratchRoot);
     BTHLogSetHandle(std::make_shared<BTHLogHandle>("fuzz", 0));
     store();
     return 0;

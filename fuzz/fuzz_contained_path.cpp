@@ -62,7 +62,11 @@ class ScratchTree {
     // is an item whose way down meets a link or a file.
     void make(char kind, const std::string& name, const std::string& text) {
         const fs::path relative(name);
-        if (name.empty() || relative.is_absolute() || text.find('\0') != std::string::npos) return;
+        // A NUL ends the name the kernel sees: "..\0x" would pass as a name
+        // and climb out.
+        if (name.empty() || relative.is_absolute() || name.find('\0') != std::string::npos ||
+            text.find('\0') != std::string::npos)
+            return;
         std::vector<std::string> parts;
         for (const auto& part : relative) {
             if (part == "..") return;
