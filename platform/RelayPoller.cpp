@@ -73,6 +73,9 @@ bool RelayPoller::reserveInline() {
 
 void RelayPoller::releaseInline() {
     inlinePlaces_.fetch_add(1, std::memory_order_release);
+    // Only while work is parked does anyone ask.
+    if (parkedCount_.load(std::memory_order_relaxed) > 0)
+        lastRelease_.store(Clock::now().time_since_epoch().count(), std::memory_order_relaxed);
 }
 
 uint64_t RelayPoller::add(int fd, uint32_t events, std::shared_ptr<Watcher> watcher) {
@@ -129,23 +132,27 @@ void RelayPoller::stop() {
 
 void RelayPoller::park(std::shared_ptr<Watcher> watcher) {
     std::lock_guard lock(parkMutex_);
-    parked_.push_back({std::move(watcher), std::chrono::steady_clock::now() + kParkedWait});
+    parked_.push_back({std::move(watcher), Clock::now()});
     parkedCount_.store(parked_.size(), std::memory_order_relaxed);
+}
+
+RelayPoller::Clock::time_point RelayPoller::expiry(Clock::time_point since) const {
+    const Clock::time_point released(Clock::duration(lastRelease_.load(std::memory_order_relaxed)));
+    return std::max(since, released) + kParkedWait;
 }
 
 int RelayPoller::parkedTimeout() {
     if (parkedCount_.load(std::memory_order_relaxed) == 0) return -1;
     std::lock_guard lock(parkMutex_);
     if (parked_.empty()) return -1;
-    const auto left = parked_.front().deadline - std::chrono::steady_clock::now();
+    const auto left = expiry(parked_.front().since) - Clock::now();
     const auto ms = std::chrono::ceil<std::chrono::milliseconds>(left).count();
     return ms > 0 ? static_cast<int>(ms) : 0;
 }
 
 std::shared_ptr<RelayPoller::Watcher> RelayPoller::takeParked(bool expiredOnly) {
     std::lock_guard lock(parkMutex_);
-    if (parked_.empty() ||
-        (expiredOnly && parked_.front().deadline > std::chrono::steady_clock::now()))
+    if (parked_.empty() || (expiredOnly && expiry(parked_.front().since) > Clock::now()))
         return nullptr;
     std::shared_ptr<Watcher> watcher = std::move(parked_.front().watcher);
     parked_.pop_front();

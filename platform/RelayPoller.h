@@ -13,9 +13,10 @@
 // but one run such inline work at a time (reserveInline), so a request that
 // blocks never stops the reading of other peers. A request read while every
 // place is taken may wait parked (park) for the next thread that finishes
-// its inline work - a thread already running, so nobody is woken - but not
-// longer than kParkedWait: then it goes to the pool (the watcher's
-// unpark()).
+// its inline work - a thread already running, so nobody is woken - for as
+// long as inline work keeps finishing: once no place has been given back
+// for kParkedWait (handlers that block, not a busy processor), it goes to
+// the pool (the watcher's unpark()).
 #pragma once
 
 #include <sys/epoll.h>
@@ -91,7 +92,7 @@ class RelayPoller {
     bool reserveInline();
     void releaseInline();
 
-    // How long parked work waits for an inline place at most.
+    // How long parked work waits while no inline place is given back.
     static constexpr std::chrono::milliseconds kParkedWait{1};
 
     // True when work can run inline at all (more than one thread), and so
@@ -116,18 +117,22 @@ class RelayPoller {
     bool busy() const { return handling_.load(std::memory_order_relaxed) > 0; }
 
     // Parks `watcher`'s work until a thread finishing inline work has a
-    // place for it (runParked) or kParkedWait has passed (unpark). Call it
+    // place for it (runParked), or until kParkedWait has passed both since
+    // it was parked and since a place was last given back (unpark). Call it
     // from a poller thread, as part of ready(), and only when
     // hasInlinePlaces().
     void park(std::shared_ptr<Watcher> watcher);
 
   private:
+    using Clock = std::chrono::steady_clock;
     struct Parked {
         std::shared_ptr<Watcher> watcher;
-        std::chrono::steady_clock::time_point deadline;
+        Clock::time_point since;
     };
 
     void run();
+    // When parked work that came at `since` is to go elsewhere.
+    Clock::time_point expiry(Clock::time_point since) const;
     // The epoll timeout that wakes a waiting thread when the oldest parked
     // work's time is up; -1 with nothing parked.
     int parkedTimeout();
@@ -142,6 +147,7 @@ class RelayPoller {
     std::mutex joinMutex_;
     std::vector<std::thread> threads_;  // set by start(), then only joined
     std::atomic<size_t> inlinePlaces_{0};
+    std::atomic<Clock::rep> lastRelease_{0};  // when a place was last given back
     size_t inlineCapacity_ = 0;  // set by start()
     std::atomic<size_t> handling_{0};
     std::mutex mutex_;

@@ -8,14 +8,15 @@ namespace berth {
 
 namespace {
 
-BTHPeerIdentity toPeerIdentity(const RelayPeerIdentity& relay) {
+// Takes the relay's copy apart rather than copying the entitlements again.
+BTHPeerIdentity toPeerIdentity(RelayPeerIdentity relay) {
     BTHPeerIdentity peer;
     peer.pid = relay.pid;
     peer.effectiveUserId = relay.effectiveUserId;
     peer.processStillBound = relay.processStillBound;
-    peer.signingIdentifier = relay.signingIdentifier;
-    peer.signingError = relay.signingError;
-    peer.entitlements = relay.entitlements;
+    peer.signingIdentifier = std::move(relay.signingIdentifier);
+    peer.signingError = std::move(relay.signingError);
+    peer.entitlements = std::move(relay.entitlements);
     return peer;
 }
 
