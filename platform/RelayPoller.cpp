@@ -138,7 +138,7 @@ void RelayPoller::park(std::shared_ptr<Watcher> watcher) {
 
 RelayPoller::Clock::time_point RelayPoller::expiry(Clock::time_point since) const {
     const Clock::time_point released(Clock::duration(lastRelease_.load(std::memory_order_relaxed)));
-    return std::max(since, released) + kParkedWait;
+    return std::min(std::max(since, released) + kParkedWait, since + kParkedLimit);
 }
 
 int RelayPoller::parkedTimeout() {

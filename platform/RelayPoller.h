@@ -15,8 +15,9 @@
 // place is taken may wait parked (park) for the next thread that finishes
 // its inline work - a thread already running, so nobody is woken - for as
 // long as inline work keeps finishing: once no place has been given back
-// for kParkedWait (handlers that block, not a busy processor), it goes to
-// the pool (the watcher's unpark()).
+// for kParkedWait (handlers that block, not a busy processor), or at the
+// latest kParkedLimit after it was parked, it goes to the pool (the
+// watcher's unpark()).
 #pragma once
 
 #include <sys/epoll.h>
@@ -92,8 +93,11 @@ class RelayPoller {
     bool reserveInline();
     void releaseInline();
 
-    // How long parked work waits while no inline place is given back.
+    // How long parked work waits while no inline place is given back, and
+    // how long at most: places that keep freeing may be taken by requests
+    // read meanwhile.
     static constexpr std::chrono::milliseconds kParkedWait{1};
+    static constexpr std::chrono::milliseconds kParkedLimit{4};
 
     // True when work can run inline at all (more than one thread), and so
     // may be parked.
@@ -118,7 +122,8 @@ class RelayPoller {
 
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked), or until kParkedWait has passed both since
-    // it was parked and since a place was last given back (unpark). Call it
+    // it was parked and since a place was last given back, or kParkedLimit
+    // since it was parked (unpark). Call it
     // from a poller thread, as part of ready(), and only when
     // hasInlinePlaces().
     void park(std::shared_ptr<Watcher> watcher);
@@ -148,7 +153,7 @@ class RelayPoller {
     std::vector<std::thread> threads_;  // set by start(), then only joined
     std::atomic<size_t> inlinePlaces_{0};
     std::atomic<Clock::rep> lastRelease_{0};  // when a place was last given back
-    size_t inlineCapacity_ = 0;  // set by start()
+    size_t inlineCapacity_ = 0;               // set by start()
     std::atomic<size_t> handling_{0};
     std::mutex mutex_;
     std::unordered_map<uint64_t, std::shared_ptr<Watcher>> watchers_;
