@@ -10,8 +10,9 @@
 // later events of the peer wait for it): the same order and the same one at
 // a time, without a hop to another thread. With every inline place taken,
 // such a request waits parked, its queue claimed the same way, for the next
-// I/O thread that finishes its own, and goes to the pool only once no
-// inline place has been given back for RelayPoller::kParkedWait. When the
+// I/O thread that finishes its own, and goes to the pool once no inline
+// place has been given back for RelayPoller::kParkedWait, or at the latest
+// after RelayPoller::kParkedLimit. When the
 // connection ends - the peer hung up, broke the protocol, flooded it, or
 // the connection was cancelled - the handler gets one last event,
 // ConnectionInvalid, after every event delivered before; then the

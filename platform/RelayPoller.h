@@ -123,9 +123,8 @@ class RelayPoller {
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked), or until kParkedWait has passed both since
     // it was parked and since a place was last given back, or kParkedLimit
-    // since it was parked (unpark). Call it
-    // from a poller thread, as part of ready(), and only when
-    // hasInlinePlaces().
+    // since it was parked (unpark). Call it from a poller thread, as part
+    // of ready(), and only when hasInlinePlaces().
     void park(std::shared_ptr<Watcher> watcher);
 
   private:
