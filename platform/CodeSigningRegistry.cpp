@@ -314,7 +314,8 @@ std::optional<PeerIdentity> CodeSigningRegistry::identify(pid_t pid, int pidfd, 
     // The process, and the path its entry is looked up by, still name this
     // very file.
     IdentityBasis basis;
-    basis.recordExecutable(executable->status);
+    basis.recordExecutable(executable->status,
+                           UniqueFd(::fcntl(executable->fd.get(), F_DUPFD_CLOEXEC, 0)));
     basis.record(executable->path, executable->status);
     std::optional<SignatureEntry> entry = entryFor(executable->path, why, &basis);
     if (!entry) return std::nullopt;

@@ -33,8 +33,9 @@ void IdentityBasis::record(std::filesystem::path path, const struct stat& status
     files_.emplace_back(std::move(path), FileVersion::of(status));
 }
 
-void IdentityBasis::recordExecutable(const struct stat& status) {
+void IdentityBasis::recordExecutable(const struct stat& status, UniqueFd file) {
     executable_ = FileVersion::of(status);
+    executableFile_ = std::move(file);
 }
 
 void IdentityBasis::recordCgroup(std::string cgroup) {
@@ -79,7 +80,18 @@ bool IdentityBasis::filesHold() {
     return true;
 }
 
-bool IdentityBasis::holds(pid_t pid, int pidfd, int procDirectory) {
+bool IdentityBasis::executableHolds(int procDirectory, const ProcessImage* image) const {
+    // An image unchanged since before the evaluation: no exec since, so the
+    // process runs the file recorded, still open here.
+    if (image && executableFile_ && image->unchanged()) {
+        struct stat status {};
+        return ::fstat(executableFile_.get(), &status) == 0 &&
+               FileVersion::of(status) == *executable_;
+    }
+    return versionAt(procDirectory, "exe") == executable_;
+}
+
+bool IdentityBasis::holds(pid_t pid, int pidfd, int procDirectory, const ProcessImage* image) {
     if (!filesHold()) return false;
     // /proc is read last. The process's own directory, opened while it
     // lived, shows only that process and nothing once it is gone; one opened
@@ -94,7 +106,7 @@ bool IdentityBasis::holds(pid_t pid, int pidfd, int procDirectory) {
         procDirectory = openedNow.get();
     }
     std::string why;
-    if (executable_ && versionAt(procDirectory, "exe") != executable_) return false;
+    if (executable_ && !executableHolds(procDirectory, image)) return false;
     if (cgroup_ && cgroupShownIn(procDirectory, &why) != cgroup_) return false;
     if (openedNow || (!executable_ && !cgroup_))
         return ::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;

@@ -16,6 +16,9 @@
 // while it has seen no change (one call), and stat'ed one by one only when it
 // has, or may have: the executable (whose contents a memory mapping could
 // change unseen), the control group and the process are checked every time.
+// The executable is checked without /proc while the process's image, opened
+// before the evaluation, is unchanged (see ProcessImage): the process then
+// still runs the very file recorded, whose version one fstat of it tells.
 //
 // Contents are told apart by their change time, which only the kernel sets.
 // A regular file changed within `window` of its recording could change again
@@ -36,6 +39,8 @@
 
 #include "platform/ChangeWatch.h"
 #include "platform/ExecutableIdentity.h"
+#include "platform/ProcessImage.h"
+#include "platform/UniqueFd.h"
 
 namespace berth {
 
@@ -44,8 +49,9 @@ class IdentityBasis {
     // Records `path` as `status` shows it; `status` must come from the very
     // object the evaluation went on to trust or read.
     void record(std::filesystem::path path, const struct stat& status);
-    // Records the file the process runs, as /proc/<pid>/exe resolves it.
-    void recordExecutable(const struct stat& status);
+    // Records the file the process runs, as /proc/<pid>/exe resolves it;
+    // `file`, when given, is that very file open.
+    void recordExecutable(const struct stat& status, UniqueFd file = {});
     // Records the control group the process was found in.
     void recordCgroup(std::string cgroup);
 
@@ -65,17 +71,21 @@ class IdentityBasis {
     // /proc directory, opened while it lived) /proc is read through that,
     // which shows nothing once the process is gone; without it, through
     // /proc/<pid>, and the pidfd then confirms the process afterwards, so
-    // what /proc showed was its own. Not safe to call from two threads at
-    // once.
-    bool holds(pid_t pid, int pidfd, int procDirectory = -1);
+    // what /proc showed was its own. `image`, when given, was opened before
+    // the evaluation this basis records. Not safe to call from two threads
+    // at once.
+    bool holds(pid_t pid, int pidfd, int procDirectory = -1, const ProcessImage* image = nullptr);
 
   private:
     // Whether every recorded file and directory is as it was; watches them
     // anew when the watch saw a change, or may have.
     bool filesHold();
+    // Whether the process still runs the recorded executable, as it was.
+    bool executableHolds(int procDirectory, const ProcessImage* image) const;
 
     std::vector<std::pair<std::filesystem::path, FileVersion>> files_;
     std::optional<FileVersion> executable_;
+    UniqueFd executableFile_;
     std::optional<std::string> cgroup_;
     bool settled_ = false;
     std::shared_ptr<ChangeWatch> watch_;

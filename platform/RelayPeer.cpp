@@ -89,6 +89,9 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
     if (peer.procDirectory_ && !pidfdRefersTo(peer.pidfd_.get(), cred.pid, &gone))
         peer.procDirectory_.reset();
     if (peer.uid_ != 0) return peer;
+    // Opened before the executable is bound: an image unchanged later means
+    // no exec since the binding (see ProcessImage).
+    peer.image_ = ProcessImage::of(peer.procDirectory_.get());
     peer.bound_ = peer.signing_->executableOf(peer.pid_, peer.pidfd_.get(), &peer.unboundReason_);
     return peer;
 }
@@ -96,7 +99,7 @@ std::optional<RelayPeer> RelayPeer::ofSocket(int fd, std::shared_ptr<CodeSigning
 RelayPeerIdentity RelayPeer::identity() const {
     std::lock_guard lock(remembered_->mutex);
     std::optional<RelayPeerIdentity>& remembered = remembered_->identity;
-    if (remembered && remembered_->basis.holds(pid_, pidfd_.get(), procDirectory_.get()))
+    if (remembered && remembered_->basis.holds(pid_, pidfd_.get(), procDirectory_.get(), &image_))
         return *remembered;
     IdentityBasis basis;
     RelayPeerIdentity evaluated = evaluate(&basis);

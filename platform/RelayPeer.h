@@ -44,6 +44,7 @@
 #include "platform/ChangeWatch.h"
 #include "platform/CodeSigningRegistry.h"
 #include "platform/ExecutableIdentity.h"
+#include "platform/ProcessImage.h"
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -111,8 +112,11 @@ class RelayPeer {
     UniqueFd pidfd_;
     // /proc/<pid>, opened while the peer lived: shows only that process.
     UniqueFd procDirectory_;
-    std::optional<ExecutableId> bound_;  // root's peers only
-    std::string unboundReason_;          // why there is no identity to be had
+    // Root's peers only: the executable bound at accept, and the process's
+    // image opened just before.
+    std::optional<ExecutableId> bound_;
+    ProcessImage image_;
+    std::string unboundReason_;  // why there is no identity to be had
     std::shared_ptr<CodeSigningService> signing_;
     std::shared_ptr<ChangeWatch> watch_;
     std::unique_ptr<Remembered> remembered_ = std::make_unique<Remembered>();

@@ -241,6 +241,31 @@ TEST_F(RelayIdentityTest, ASignedPeerIsIdentifiedAfreshOnEveryRequest) {
     EXPECT_EQ(seen(2).entitlements, entitlementsAllowing("sys.kelp.private.Berth.dataMigration"));
 }
 
+TEST_F(RelayIdentityTest, ARememberedIdentityEndsWithAnExecOfAnotherProgram) {
+    // A signed peer re-executing its own file stays what it was: the file
+    // bound at accept is the one it runs.
+    ClientProcess client(signed_, server_->path(), signed_);
+    ASSERT_EQ(client.readLine(), "connected");
+    ASSERT_EQ(client.command("send 1"), "ok");
+    ASSERT_EQ(client.command("send 2"), "ok");
+    ASSERT_EQ(seen(2).signingIdentifier, "sys.kelp.test.client");
+    ASSERT_EQ(client.command("exec"), "connected");
+    ASSERT_EQ(client.command("send 3"), "ok");
+    EXPECT_EQ(seen(3).signingIdentifier, "sys.kelp.test.client") << seen(3).signingError;
+
+    // Once its identity is remembered, an exec of anything else ends it.
+    ClientProcess other(signed_, server_->path(), unsigned_);
+    ASSERT_EQ(other.readLine(), "connected");
+    ASSERT_EQ(other.command("send 4"), "ok");
+    ASSERT_EQ(other.command("send 5"), "ok");
+    ASSERT_EQ(seen(5).signingIdentifier, "sys.kelp.test.client");
+    ASSERT_EQ(other.command("exec"), "connected");
+    for (uint64_t tag : {6, 7}) {
+        ASSERT_EQ(other.command("send " + std::to_string(tag)), "ok");
+        expectUnbound(seen(tag), other.pid(), "another executable");
+    }
+}
+
 TEST_F(RelayIdentityTest, ABinaryReplacedOnDiskAfterConnectIsNotTrustedWithTheOldSignature) {
     ClientProcess client(signed_, server_->path(), signed_);
     ASSERT_EQ(client.readLine(), "connected");
