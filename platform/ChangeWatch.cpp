@@ -18,6 +18,9 @@ constexpr uint32_t kDirectoryMask =
     IN_ATTRIB | IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MOVE_SELF | IN_DELETE_SELF;
 // What changes a watched item itself: the above and its contents.
 constexpr uint32_t kItemMask = kDirectoryMask | IN_MODIFY;
+// What changes the names on the way to an item, and the item's own.
+constexpr uint32_t kNamesMask =
+    IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MOVE_SELF | IN_DELETE_SELF;
 
 // Reads of the queue per drain. A queue still not empty after them is taken
 // for a change, so a flood of events costs the callers their stats but never
@@ -30,13 +33,13 @@ constexpr size_t kMaxNames = size_t{1} << 16;
 
 }  // namespace
 
-std::unique_ptr<ChangeWatch> ChangeWatch::make(std::string* why) {
+std::unique_ptr<ChangeWatch> ChangeWatch::make(std::string* why, Kind kind) {
     UniqueFd inotify(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
     if (!inotify) {
         if (why) *why = std::string("no inotify instance: ") + strerror(errno);
         return nullptr;
     }
-    return std::make_unique<ChangeWatch>(Passkey{}, std::move(inotify));
+    return std::make_unique<ChangeWatch>(Passkey{}, std::move(inotify), kind);
 }
 
 uint64_t ChangeWatch::now() {
@@ -63,7 +66,8 @@ bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string
     // The item itself is watched as it is (a link as a link, as it was
     // recorded); a directory on the way is watched where it leads, since the
     // names below it are looked up there.
-    const uint32_t mask = child.empty() ? kItemMask | IN_DONT_FOLLOW : kDirectoryMask;
+    uint32_t mask = child.empty() ? kItemMask | IN_DONT_FOLLOW : kDirectoryMask;
+    if (kind_ == Kind::kNamesOnly) mask = kNamesMask | (mask & IN_DONT_FOLLOW);
     const int wd = ::inotify_add_watch(inotify_.get(), path.c_str(), mask);
     if (wd < 0) return false;
     std::set<std::string>& names = names_[wd];

@@ -41,10 +41,18 @@ class ChangeWatch {
     struct Passkey {};
 
   public:
+    // What counts as a change of an item: everything above, or only what
+    // changes the names on its way (a removal, rename or replacement of it
+    // or of a directory above it), for callers that rely on an item being
+    // there and not on what it holds, so that writes and chmods do not cost
+    // them their checks.
+    enum class Kind { kContentsAndNames, kNamesOnly };
+
     // A watch with an inotify instance of its own; null, with the reason,
     // when the kernel gives none (then nothing can be watched).
-    static std::unique_ptr<ChangeWatch> make(std::string* why = nullptr);
-    ChangeWatch(Passkey, UniqueFd inotify) : inotify_(std::move(inotify)) {}
+    static std::unique_ptr<ChangeWatch> make(std::string* why = nullptr,
+                                             Kind kind = Kind::kContentsAndNames);
+    ChangeWatch(Passkey, UniqueFd inotify, Kind kind) : inotify_(std::move(inotify)), kind_(kind) {}
     ChangeWatch(const ChangeWatch&) = delete;
     ChangeWatch& operator=(const ChangeWatch&) = delete;
 
@@ -75,6 +83,7 @@ class ChangeWatch {
     bool watchItem(const std::filesystem::path& path, const std::string& child);
 
     const UniqueFd inotify_;
+    const Kind kind_;
     // Changes seen so far; a moment is a value of it.
     std::atomic<uint64_t> changes_{0};
     // Odd while a thread reads the queue: announced before the read, so a

@@ -93,7 +93,7 @@ BTHMetadataRef BTHContainerCache::containerForUser(uid_t userId, uint64_t contai
             return nullptr;
         }
         const std::filesystem::path metadataFile = BTHMetadata::metadataFileURL(url);
-        if (!BTHFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+        if (!presence_.itemExists(metadataFile)) {
             BTHSetError(error, BTHMakeError(BTHErrorCacheInconsistent, nullptr,
                                             "Cache: %@%@: INCONSISTENT-No Metadata at: %@",
                                             className, suffix, metadataFile));
@@ -166,7 +166,7 @@ std::optional<std::vector<BTHMetadataRef>> BTHContainerCache::allContainersForUs
                 continue;
             }
             const std::filesystem::path metadataFile = BTHMetadata::metadataFileURL(item.url);
-            if (!BTHFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+            if (!presence_.itemExists(metadataFile)) {
                 BTHMakeError(BTHErrorCacheInconsistent, nullptr,
                              "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className, suffix,
                              metadataFile);
@@ -288,6 +288,7 @@ void BTHContainerCache::resetForTesting() {
     std::lock_guard lock(cacheLock_);
     liveContainerCache_.clear();
     transientContainerCache_.clear();
+    presence_.reset();
 }
 
 BTHContainerCache::ClassMap* BTHContainerCache::getCacheForUserId(uid_t userId,

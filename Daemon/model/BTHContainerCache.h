@@ -42,6 +42,7 @@
 
 #include "BTHError.h"
 #include "BTHMetadata.h"
+#include "BTHMetadataPresence.h"
 
 namespace berth {
 
@@ -54,7 +55,8 @@ class BTHContainerCache {
     // The entry of `identifier`, checked against the disk after the lock is
     // released (its metadata file must still exist, else 44; the entry stays,
     // removing it is the caller's decision). After the map's first build a
-    // look-up costs one map access and one lstat.
+    // look-up costs one map access and, while nothing on the file's way
+    // changed, one call on a change watch (see BTHMetadataPresence).
     BTHMetadataRef containerForUser(uid_t userId, uint64_t containerClass,
                                     const std::string& identifier, bool transient,
                                     BTHErrorRef* error);
@@ -127,6 +129,8 @@ class BTHContainerCache {
     std::mutex cacheLock_;
     std::map<std::string, ClassMap> liveContainerCache_;
     std::map<std::string, ClassMap> transientContainerCache_;
+    // The existence checks of found entries (safe without cacheLock_).
+    BTHMetadataPresence presence_;
 };
 
 }  // namespace berth

@@ -1,6 +1,7 @@
 #include "BTHContainerCache.h"
 
 #include <cctype>
+#include <functional>
 
 #include "BTHFileManager.h"
 #include "BTHGlobalConfiguration.h"
@@ -169,6 +170,41 @@ TEST_F(BTHContainerCacheTest, BadClassesAndUsersFailWith47BeforeTouchingTheDisk)
     EXPECT_FALSE(cache().addContainerMetadata(nullptr, kMobile, "/c", false, &error));
     expectError(error, BTHErrorCacheInvalidInput, "Invalid metadata Identifier: (null)");
     EXPECT_EQ(record->url(), "/");
+}
+
+TEST_F(BTHContainerCacheTest, AFoundEntryGives44OnceItsPathNoLongerLeadsToItsFileWithoutLinks) {
+    BTHMetadataRef a = makeContainer(kData, "com.a");
+    const fs::path url = a->url();
+    const fs::path moved = url.parent_path() / "moved-away";
+    const fs::path classDir = classDirectory(kMobile, kData);
+    const fs::path movedClass = classDir.parent_path() / "moved-class";
+    // Each change after the entry was found twice (so the second answer came
+    // from what was remembered of the first), then put back.
+    const std::vector<std::pair<const char*, std::function<void(bool undo)>>> changes = {
+        {"container directory renamed away",
+         [&](bool undo) { undo ? fs::rename(moved, url) : fs::rename(url, moved); }},
+        {"class directory replaced by a link to it",
+         [&](bool undo) {
+             if (undo) {
+                 fs::remove(classDir);
+                 fs::rename(movedClass, classDir);
+             } else {
+                 fs::rename(classDir, movedClass);
+                 fs::create_directory_symlink(movedClass, classDir);
+             }
+         }},
+    };
+    for (const auto& [what, change] : changes) {
+        ASSERT_NE(find(kData, "com.a"), nullptr) << what;
+        ASSERT_NE(find(kData, "com.a"), nullptr) << what;
+        change(false);
+        BTHErrorRef error;
+        EXPECT_EQ(find(kData, "com.a", false, &error), nullptr) << what;
+        ASSERT_NE(error, nullptr) << what;
+        EXPECT_TRUE(error->isBTHError(BTHErrorCacheInconsistent)) << error->description();
+        change(true);
+        EXPECT_NE(find(kData, "com.a"), nullptr) << what;
+    }
 }
 
 TEST_F(BTHContainerCacheTest, MissingMetadataFileGives44OnLookUpAndIsLeftOutOfTheListing) {

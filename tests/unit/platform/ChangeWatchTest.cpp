@@ -95,6 +95,39 @@ TEST_F(ChangeWatchTest, OtherNamesInTheSameDirectoriesAreNoChange) {
     EXPECT_TRUE(watch_->unchangedSince(moment));
 }
 
+TEST_F(ChangeWatchTest, AWatchOfNamesOnlySeesTheItemGoButNotItsContentsOrModes) {
+    watch_ = ChangeWatch::make(nullptr, ChangeWatch::Kind::kNamesOnly);
+    ASSERT_TRUE(watch_);
+    uint64_t moment = watched();
+    test::writeFile(item(), "rewritten");
+    stdfs::permissions(item(), stdfs::perms(0600));
+    stdfs::permissions(dir_ / "a", stdfs::perms(0777));
+    EXPECT_TRUE(watch_->unchangedSince(moment));
+
+    const std::vector<std::pair<const char*, std::function<void()>>> changes = {
+        {"removed and made again",
+         [&] {
+             stdfs::remove(item());
+             test::writeFile(item(), "entry");
+         }},
+        {"another file renamed over it",
+         [&] {
+             test::writeFile(dir_ / "a/b/new", "entry");
+             stdfs::rename(dir_ / "a/b/new", item());
+         }},
+        {"a directory on the way replaced by a link to it",
+         [&] {
+             stdfs::rename(dir_ / "a", dir_ / "moved");
+             stdfs::create_directory_symlink(dir_ / "moved", dir_ / "a");
+         }},
+    };
+    for (const auto& [what, change] : changes) {
+        moment = watched();
+        change();
+        EXPECT_FALSE(watch_->unchangedSince(moment)) << what;
+    }
+}
+
 TEST_F(ChangeWatchTest, AFloodOfOtherEventsCountsAsAChangeRatherThanBeingReadWithoutEnd) {
     const uint64_t moment = watched();
     // Alternating names, since the kernel folds an event into an identical
