@@ -17,6 +17,8 @@
 // caller checks /proc instead.
 #pragma once
 
+#include <cstdint>
+
 #include "platform/UniqueFd.h"
 
 namespace berth {
@@ -38,6 +40,9 @@ class ProcessImage {
 
   private:
     UniqueFd memory_;
+    // Where the image's own copy of the kernel's shared page (vDSO) lies, as
+    // its auxiliary vector said when it was opened; 0 when not said.
+    uint64_t probe_ = 0;
 };
 
 }  // namespace berth
