@@ -165,8 +165,11 @@ std::optional<std::vector<BTHMetadataRef>> BTHContainerCache::allContainersForUs
                              className, suffix, item.url);
                 continue;
             }
+            // On disk, file by file: watching every file of a class would
+            // walk each directory on the way of each file, far more than
+            // these checks cost.
             const std::filesystem::path metadataFile = BTHMetadata::metadataFileURL(item.url);
-            if (!presence_.itemExists(metadataFile)) {
+            if (!BTHFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
                 BTHMakeError(BTHErrorCacheInconsistent, nullptr,
                              "Cache: %@%@: INCONSISTENT-No Metadata at: %@", className, suffix,
                              metadataFile);

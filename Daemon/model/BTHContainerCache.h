@@ -129,7 +129,8 @@ class BTHContainerCache {
     std::mutex cacheLock_;
     std::map<std::string, ClassMap> liveContainerCache_;
     std::map<std::string, ClassMap> transientContainerCache_;
-    // The existence checks of found entries (safe without cacheLock_).
+    // The existence checks of entries found by look-ups (safe without
+    // cacheLock_).
     BTHMetadataPresence presence_;
 };
 
