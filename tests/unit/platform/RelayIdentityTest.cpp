@@ -242,28 +242,29 @@ TEST_F(RelayIdentityTest, ASignedPeerIsIdentifiedAfreshOnEveryRequest) {
 }
 
 TEST_F(RelayIdentityTest, ARememberedIdentityEndsWithAnExecOfAnotherProgram) {
-    // A signed peer re-executing its own file stays what it was: the file
-    // bound at accept is the one it runs.
-    ClientProcess client(signed_, server_->path(), signed_);
-    ASSERT_EQ(client.readLine(), "connected");
-    ASSERT_EQ(client.command("send 1"), "ok");
-    ASSERT_EQ(client.command("send 2"), "ok");
-    ASSERT_EQ(seen(2).signingIdentifier, "sys.kelp.test.client");
-    ASSERT_EQ(client.command("exec"), "connected");
-    ASSERT_EQ(client.command("send 3"), "ok");
-    EXPECT_EQ(seen(3).signingIdentifier, "sys.kelp.test.client") << seen(3).signingError;
+    // A signed client sends two requests (the second served from the
+    // remembered identity), then execs `target`; its next request is `tag`.
+    auto execAfterRemembered = [&](ClientProcess& client, uint64_t tag) {
+        EXPECT_EQ(client.readLine(), "connected");
+        for (uint64_t sent : {tag - 2, tag - 1})
+            EXPECT_EQ(client.command("send " + std::to_string(sent)), "ok");
+        EXPECT_EQ(seen(tag - 1).signingIdentifier, "sys.kelp.test.client");
+        EXPECT_EQ(client.command("exec"), "connected");
+        EXPECT_EQ(client.command("send " + std::to_string(tag)), "ok");
+        return seen(tag);
+    };
 
-    // Once its identity is remembered, an exec of anything else ends it.
+    // Re-executing its own file it stays what it was: the file bound at
+    // accept is the one it runs.
+    ClientProcess same(signed_, server_->path(), signed_);
+    const RelayPeerIdentity reexec = execAfterRemembered(same, 3);
+    EXPECT_EQ(reexec.signingIdentifier, "sys.kelp.test.client") << reexec.signingError;
+
+    // Anything else ends it, for good.
     ClientProcess other(signed_, server_->path(), unsigned_);
-    ASSERT_EQ(other.readLine(), "connected");
-    ASSERT_EQ(other.command("send 4"), "ok");
-    ASSERT_EQ(other.command("send 5"), "ok");
-    ASSERT_EQ(seen(5).signingIdentifier, "sys.kelp.test.client");
-    ASSERT_EQ(other.command("exec"), "connected");
-    for (uint64_t tag : {6, 7}) {
-        ASSERT_EQ(other.command("send " + std::to_string(tag)), "ok");
-        expectUnbound(seen(tag), other.pid(), "another executable");
-    }
+    expectUnbound(execAfterRemembered(other, 6), other.pid(), "another executable");
+    ASSERT_EQ(other.command("send 7"), "ok");
+    expectUnbound(seen(7), other.pid(), "another executable");
 }
 
 TEST_F(RelayIdentityTest, ABinaryReplacedOnDiskAfterConnectIsNotTrustedWithTheOldSignature) {
