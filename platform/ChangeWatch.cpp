@@ -47,22 +47,24 @@ uint64_t ChangeWatch::now() {
     return changes_.load();
 }
 
-bool ChangeWatch::watch(const std::filesystem::path& path) {
+bool ChangeWatch::watch(const std::filesystem::path& path, Ticket* ticket) {
     std::string item = path.lexically_normal().string();
     while (item.size() > 1 && item.back() == '/') item.pop_back();
     if (item.empty() || item.front() != '/') return false;
+    if (ticket) ticket->names.clear();
     std::lock_guard lock(mutex_);
-    if (!watchItem(item, {})) return false;
+    if (!watchItem(item, {}, ticket)) return false;
     while (item != "/") {
         const size_t slash = item.rfind('/');
         const std::string name = item.substr(slash + 1);
         item = slash == 0 ? std::string("/") : item.substr(0, slash);
-        if (!watchItem(item, name)) return false;
+        if (!watchItem(item, name, ticket)) return false;
     }
     return true;
 }
 
-bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string& child) {
+bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string& child,
+                            Ticket* ticket) {
     // The item itself is watched as it is (a link as a link, as it was
     // recorded); a directory on the way is watched where it leads, since the
     // names below it are looked up there.
@@ -70,6 +72,10 @@ bool ChangeWatch::watchItem(const std::filesystem::path& path, const std::string
     if (kind_ == Kind::kNamesOnly) mask = kNamesMask | (mask & IN_DONT_FOLLOW);
     const int wd = ::inotify_add_watch(inotify_.get(), path.c_str(), mask);
     if (wd < 0) return false;
+    if (ticket) {
+        ticket->names.emplace_back(wd, std::string());
+        if (!child.empty()) ticket->names.emplace_back(wd, child);
+    }
     std::set<std::string>& names = names_[wd];
     if (child.empty() || names.count(child)) return true;
     if (nameCount_ >= kMaxNames) return false;
@@ -93,26 +99,50 @@ bool ChangeWatch::unchangedSince(uint64_t moment) {
     return changes_.load() == moment;
 }
 
+bool ChangeWatch::unchangedSince(const Ticket& ticket, uint64_t moment) {
+    if (unchangedSince(moment)) return true;
+    // Something changed: whatever is queued now is counted before the names
+    // are looked at (as in unchangedSince(moment), a reader mid-way is
+    // waited for).
+    const uint64_t reading = reading_.load();
+    int queued = 0;
+    if ((reading & 1) != 0 || ::ioctl(inotify_.get(), FIONREAD, &queued) != 0 || queued != 0 ||
+        reading_.load() != reading)
+        drain();
+    std::lock_guard lock(mutex_);
+    if (everythingChangedAt_ > moment) return false;
+    for (const auto& name : ticket.names) {
+        const auto changed = changedAt_.find(name);
+        if (changed != changedAt_.end() && changed->second > moment) return false;
+    }
+    return true;
+}
+
 void ChangeWatch::drain() {
     std::lock_guard lock(mutex_);
     reading_.fetch_add(1);
+    // Only drain() adds to the count, under the lock: each change found here
+    // is counted as the one after the count so far.
+    const uint64_t before = changes_.load();
     uint64_t found = 0;
     alignas(inotify_event) char buffer[16 * 1024];
     for (int reads = 0;; ++reads) {
         if (reads == kMaxReadsPerDrain) {
-            ++found;
+            countChange(-1, {}, before + ++found);
             break;
         }
         const ssize_t count = ::read(inotify_.get(), buffer, sizeof buffer);
         if (count < 0 && errno == EINTR) continue;
         if (count <= 0) {
             // Anything but an empty queue leaves the queue unknown.
-            if (count == 0 || errno != EAGAIN) ++found;
+            if (count == 0 || errno != EAGAIN) countChange(-1, {}, before + ++found);
             break;
         }
         for (ssize_t at = 0; at < count;) {
             const auto* event = reinterpret_cast<const inotify_event*>(buffer + at);
-            if (isChange(event->wd, event->mask, event->len ? event->name : nullptr)) ++found;
+            if (isChange(event->wd, event->mask, event->len ? event->name : nullptr,
+                         before + found + 1))
+                ++found;
             at += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
         }
     }
@@ -120,8 +150,21 @@ void ChangeWatch::drain() {
     reading_.fetch_add(1);
 }
 
-bool ChangeWatch::isChange(int wd, uint32_t mask, const char* name) {
-    if (mask & IN_Q_OVERFLOW) return true;
+void ChangeWatch::countChange(int wd, const std::string& name, uint64_t count) {
+    if (wd < 0 || changedAt_.size() >= kMaxNames) {
+        // Beyond the names remembered, everything counts as changed.
+        changedAt_.clear();
+        everythingChangedAt_ = count;
+        return;
+    }
+    changedAt_[{wd, name}] = count;
+}
+
+bool ChangeWatch::isChange(int wd, uint32_t mask, const char* name, uint64_t count) {
+    if (mask & IN_Q_OVERFLOW) {
+        countChange(-1, {}, count);
+        return true;
+    }
     const auto watched = names_.find(wd);
     if (mask & IN_IGNORED) {
         // The item is gone (or its file system): so is the kernel's watch.
@@ -129,13 +172,18 @@ bool ChangeWatch::isChange(int wd, uint32_t mask, const char* name) {
             nameCount_ -= watched->second.size();
             names_.erase(watched);
         }
+        countChange(wd, {}, count);
         return true;
     }
     if (watched == names_.end()) return false;
-    if (!name || !*name) return true;  // the item itself
+    if (!name || !*name) {  // the item itself
+        countChange(wd, {}, count);
+        return true;
+    }
     std::set<std::string>& names = watched->second;
     const auto found = names.find(name);
     if (found == names.end()) return false;
+    countChange(wd, *found, count);
     if (mask & (IN_DELETE | IN_MOVED_FROM)) {
         // Whoever relied on the name watches it again before relying anew.
         names.erase(found);

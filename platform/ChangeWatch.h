@@ -32,6 +32,8 @@
 #include <mutex>
 #include <set>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "platform/UniqueFd.h"
 
@@ -61,26 +63,44 @@ class ChangeWatch {
     // checks or by unchangedSince().
     uint64_t now();
 
+    // What one watch() call watches: the item and each directory above it,
+    // with the name looked up in each. Lets a caller ask about its own path
+    // only (see unchangedSince below).
+    struct Ticket {
+        std::vector<std::pair<int, std::string>> names;  // (kernel watch, name or "")
+    };
+
     // Watches the item at the absolute `path` (a last link is watched itself,
-    // not followed) and its name in each directory above it. False when any
-    // of it cannot be watched (a component is missing, the kernel's limit of
-    // watches is reached): a decision resting on `path` must not rely on
-    // the watch then.
-    bool watch(const std::filesystem::path& path);
+    // not followed) and its name in each directory above it; `ticket`, when
+    // given, receives what was watched. False when any of it cannot be
+    // watched (a component is missing, the kernel's limit of watches is
+    // reached): a decision resting on `path` must not rely on the watch then.
+    bool watch(const std::filesystem::path& path, Ticket* ticket = nullptr);
 
     // True when no watched item changed since `moment`; false when one did,
     // or may have.
     bool unchangedSince(uint64_t moment);
+    // True when nothing that `ticket` names changed since `moment` (taken
+    // before the watch() that gave the ticket, or later), whatever else did;
+    // false when it did, or may have (an overflowed or flooded queue, or
+    // more changed names than are remembered, count for every ticket).
+    bool unchangedSince(const Ticket& ticket, uint64_t moment);
 
   private:
     // Reads every queued event, counting the changes among them.
     void drain();
     // Whether an event is a change of something watched; forgets names and
     // watches that the event shows are gone. Called with mutex_ held.
-    bool isChange(int wd, uint32_t mask, const char* name);
+    // A change is noted as `count`, the count it makes.
+    bool isChange(int wd, uint32_t mask, const char* name, uint64_t count);
+    // Notes a change counted as `count`: of the name `name` in watch `wd`
+    // ("" for the watched item or directory itself), or with `wd` < 0 of
+    // everything. Called with mutex_ held.
+    void countChange(int wd, const std::string& name, uint64_t count);
     // Adds (or finds) the kernel's watch of `path` and, when `child` is not
-    // empty, takes note of that name in it. Called with mutex_ held.
-    bool watchItem(const std::filesystem::path& path, const std::string& child);
+    // empty, takes note of that name in it; both go to `ticket` when given. Called with mutex_
+    // held.
+    bool watchItem(const std::filesystem::path& path, const std::string& child, Ticket* ticket);
 
     const UniqueFd inotify_;
     const Kind kind_;
@@ -96,6 +116,11 @@ class ChangeWatch {
     // item itself only).
     std::map<int, std::set<std::string>> names_;
     size_t nameCount_ = 0;
+    // The count at the last change of each (watch, name) that changed, and
+    // the count at the last change of everything (before which no ticket
+    // holds). Guarded by mutex_.
+    std::map<std::pair<int, std::string>, uint64_t> changedAt_;
+    uint64_t everythingChangedAt_ = 0;
 };
 
 }  // namespace berth

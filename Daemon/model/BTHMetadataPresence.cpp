@@ -24,19 +24,28 @@ bool BTHMetadataPresence::itemExists(const std::filesystem::path& metadataFile) 
     }
     if (found && watch_->unchangedSince(found->moment)) return true;
 
+    // The moment comes first: a change after it is either seen by the check
+    // below (of the file's own names, or of the disk) or counted by the watch.
+    const uint64_t moment = watch_->now();
+    if (found && watch_->unchangedSince(found->ticket, found->moment)) {
+        // Something else changed: the file's names did not, so it is still
+        // there, and is now known so as of `moment`.
+        remember(metadataFile, {std::move(found->ticket), moment, found->watchedAt});
+        return true;
+    }
     const auto now = std::chrono::steady_clock::now();
     const bool rewatch = !found || now - found->watchedAt >= kRewatchInterval;
-    // The moment comes first: a change after it is either seen by the disk
-    // check below or counted by the watch.
-    const uint64_t moment = watch_->now();
-    const bool watched = rewatch && watch_->watch(metadataFile);
+    ChangeWatch::Ticket ticket;
+    const bool watched = rewatch && watch_->watch(metadataFile, &ticket);
     if (!files.itemExistsAtURL(metadataFile)) return false;
-    if (watched) {
-        std::lock_guard lock(mutex_);
-        if (found_.size() >= kMaxFound) found_.clear();
-        found_[metadataFile.native()] = {moment, now};
-    }
+    if (watched) remember(metadataFile, {std::move(ticket), moment, now});
     return true;
+}
+
+void BTHMetadataPresence::remember(const std::filesystem::path& metadataFile, Found found) {
+    std::lock_guard lock(mutex_);
+    if (found_.size() >= kMaxFound) found_.clear();
+    found_[metadataFile.native()] = std::move(found);
 }
 
 void BTHMetadataPresence::reset() {

@@ -5,18 +5,20 @@
 //
 // A file found present is watched (ChangeWatch, names only: the file's name
 // and the name of every directory above it), with the watch's moment taken
-// before the disk check. Until the watch counts a change, the file is still
-// there: removing or renaming it or a directory on its way, or putting
-// another item (a link) in the place of one, is such a change. After any
-// change, or when nothing can be watched, a file is checked on the disk as
+// before the disk check. Until the watch counts a change of one of those
+// names, the file is still there: removing or renaming it or a directory on
+// its way, or putting another item (a link) in the place of one, is such a
+// change; changes of other files' names cost one look at the watch's notes.
+// After a change of its own names (or an overflowed queue), or when nothing
+// can be watched, a file is checked on the disk as
 // BTHFileManager::itemExistsAtURL does (no link on the way followed), and
 // watched again. Not seen by the watch: a file system mounted over a
 // directory on the way, which only root can do.
 //
-// Re-watching walks every directory on the way. A file whose check found a
-// change is watched again at most once per kRewatchInterval, so that
-// someone renaming names in a loop costs the daemon no more than the disk
-// checks it made before there was a watch.
+// Re-watching walks every directory on the way. A file whose names changed
+// is watched again at most once per kRewatchInterval, so that someone
+// renaming its names in a loop costs the daemon no more than the disk checks
+// it made before there was a watch.
 #pragma once
 
 #include <chrono>
@@ -48,9 +50,11 @@ class BTHMetadataPresence {
 
   private:
     struct Found {
-        uint64_t moment;  // the watch's, taken before the file was found
+        ChangeWatch::Ticket ticket;  // the file's names, as watched
+        uint64_t moment;             // the watch's, taken before the file was found
         std::chrono::steady_clock::time_point watchedAt;
     };
+    void remember(const std::filesystem::path& metadataFile, Found found);
     // Files remembered at most; beyond it all are forgotten at once.
     static constexpr size_t kMaxFound = size_t{1} << 16;
 

@@ -142,6 +142,33 @@ TEST_F(ChangeWatchTest, AFloodOfOtherEventsCountsAsAChangeRatherThanBeingReadWit
     EXPECT_TRUE(watch_->unchangedSince(after));
 }
 
+TEST_F(ChangeWatchTest, ATicketAnswersForItsOwnPathWhateverElseChanged) {
+    stdfs::create_directories(dir_ / "x");
+    test::writeFile(dir_ / "x/item", "x");
+    ChangeWatch::Ticket mine, other;
+    const uint64_t moment = watch_->now();
+    ASSERT_TRUE(watch_->watch(item(), &mine));
+    ASSERT_TRUE(watch_->watch(dir_ / "x/item", &other));
+
+    test::writeFile(dir_ / "x/item", "rewritten");
+    EXPECT_FALSE(watch_->unchangedSince(moment));
+    EXPECT_TRUE(watch_->unchangedSince(mine, moment));
+    EXPECT_FALSE(watch_->unchangedSince(other, moment));
+    // A change on the way, still queued when the ticket is asked about.
+    stdfs::rename(dir_ / "a/b", dir_ / "a/c");
+    EXPECT_FALSE(watch_->unchangedSince(mine, moment));
+
+    // A flood among other names counts for every ticket.
+    stdfs::rename(dir_ / "a/c", dir_ / "a/b");
+    const uint64_t later = watch_->now();
+    ASSERT_TRUE(watch_->watch(item(), &mine));
+    test::writeFile(dir_ / "x/p", "p");
+    test::writeFile(dir_ / "x/q", "q");
+    for (int i = 0; i < 5000; ++i)
+        stdfs::permissions(dir_ / (i % 2 ? "x/p" : "x/q"), stdfs::perms(0600));
+    EXPECT_FALSE(watch_->unchangedSince(mine, later));
+}
+
 TEST_F(ChangeWatchTest, ANameSeenGoneMustBeWatchedAgainToCount) {
     uint64_t moment = watched();
     stdfs::remove(item());
