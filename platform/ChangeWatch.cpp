@@ -91,12 +91,15 @@ bool ChangeWatch::unchangedSince(uint64_t moment) {
     // a time does, and count.
     const uint64_t reading = reading_.load();
     if (changes_.load() != moment) return false;
-    int queued = 0;
-    if ((reading & 1) == 0 && ::ioctl(inotify_.get(), FIONREAD, &queued) == 0 && queued == 0 &&
-        reading_.load() == reading)
-        return true;
+    if (nothingQueuedSince(reading)) return true;
     drain();
     return changes_.load() == moment;
+}
+
+bool ChangeWatch::nothingQueuedSince(uint64_t reading) {
+    int queued = 0;
+    return (reading & 1) == 0 && ::ioctl(inotify_.get(), FIONREAD, &queued) == 0 && queued == 0 &&
+           reading_.load() == reading;
 }
 
 bool ChangeWatch::unchangedSince(const Ticket& ticket, uint64_t moment) {
@@ -104,11 +107,7 @@ bool ChangeWatch::unchangedSince(const Ticket& ticket, uint64_t moment) {
     // Something changed: whatever is queued now is counted before the names
     // are looked at (as in unchangedSince(moment), a reader mid-way is
     // waited for).
-    const uint64_t reading = reading_.load();
-    int queued = 0;
-    if ((reading & 1) != 0 || ::ioctl(inotify_.get(), FIONREAD, &queued) != 0 || queued != 0 ||
-        reading_.load() != reading)
-        drain();
+    if (!nothingQueuedSince(reading_.load())) drain();
     std::lock_guard lock(mutex_);
     if (everythingChangedAt_ > moment) return false;
     for (const auto& name : ticket.names) {

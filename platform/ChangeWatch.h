@@ -89,6 +89,9 @@ class ChangeWatch {
   private:
     // Reads every queued event, counting the changes among them.
     void drain();
+    // True when the queue is empty and no thread began reading it since
+    // reading_ was `reading` (so every change before the call is counted).
+    bool nothingQueuedSince(uint64_t reading);
     // Whether an event is a change of something watched; forgets names and
     // watches that the event shows are gone. Called with mutex_ held.
     // A change is noted as `count`, the count it makes.
