@@ -13,9 +13,6 @@ namespace {
 
 constexpr int kLogError = 3;
 constexpr int kLogDebug = 7;
-// At most this many requests of one peer run back to back on the thread that
-// read the first, before it waits on the poller again.
-constexpr int kInlineTurns = 8;
 
 }  // namespace
 
@@ -160,13 +157,13 @@ void RelayConnection::ready(uint32_t events) {
 }
 
 void RelayConnection::runInline(RelayEvent event) {
-    // Gives back the poller's place (when held) and arms the socket for
-    // reading again, even on a throw.
+    // Gives back the poller's place and arms the socket for reading again,
+    // even on a throw. The peer's next request is not looked for here: it
+    // waits for its turn behind the peers that became ready before it.
     struct Finish {
         RelayConnection& connection;
-        bool holdsPlace = true;
         ~Finish() {
-            if (holdsPlace) connection.poller_->releaseInline();
+            connection.poller_->releaseInline();
             Released released(connection);
             std::lock_guard lock(connection.mutex_);
             // A request of the peer parked by the last read still counts
@@ -177,17 +174,7 @@ void RelayConnection::runInline(RelayEvent event) {
             connection.updateInterestLocked(true);
         }
     } finish{*this};
-    std::optional<RelayEvent> next(std::move(event));
-    for (int turn = 1;; ++turn) {
-        // Requests already buffered when this one ends run here too rather
-        // than being handed to a pool thread.
-        queue_->runClaimed([&] { deliver(*next); }, true);
-        poller_->releaseInline();
-        finish.holdsPlace = false;
-        next.reset();
-        if (turn == kInlineTurns || !readNextInline(&next)) return;
-        finish.holdsPlace = true;
-    }
+    queue_->runClaimed([&] { deliver(event); }, true);
 }
 
 void RelayConnection::runParked() {
@@ -221,17 +208,6 @@ void RelayConnection::unpark() {
     pool->async([self = shared_from_this(), event = std::move(*event)] {
         self->queue_->runClaimed([&] { self->deliver(event); }, true);
     });
-}
-
-bool RelayConnection::readNextInline(std::optional<RelayEvent>* next) {
-    Released released(*this);
-    std::lock_guard lock(mutex_);
-    // Only what the poller would read now: nothing while replies pile up.
-    if (closed_ || queued_ != 0 || pendingOutputLocked() > options_.limits.outputHighWater)
-        return false;
-    readLocked(released, next);
-    chargeLocked(released);
-    return next->has_value();
 }
 
 bool RelayConnection::claimInlineLocked() {

@@ -225,13 +225,8 @@ class RelayConnection final : public RelayPoller::Watcher,
     // Takes off the socket the bytes a peek left there (see peeked_).
     void takePeekedLocked(Released& released);
     // Runs an event pumpLocked() left for inline running, then gives back
-    // the claim and the poller's place. The peer's next request, when it has
-    // already arrived, is read and run here as well (a few times at most):
-    // it spares the re-arming, a wait on the poller and a thread's wake-up.
+    // the claim and the poller's place.
     void runInline(RelayEvent event);
-    // Reads the socket once from an inline run; true when that gave a
-    // request to run inline, in `next`.
-    bool readNextInline(std::optional<RelayEvent>* next);
     // Writes what the socket takes; false (connection closed) on an error.
     bool flushLocked(Released& released);
     // Waits for exactly the readiness the connection can use now. The

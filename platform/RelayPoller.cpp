@@ -2,6 +2,7 @@
 
 #include <pthread.h>
 #include <sys/eventfd.h>
+#include <sys/timerfd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -14,6 +15,10 @@ namespace {
 constexpr uint64_t kWakeToken = 0;
 constexpr int kEventsPerWait = 64;
 
+// Whether this poller thread's last event was already waiting when it
+// asked (read by busy()).
+thread_local bool foundWaiting = false;
+
 }  // namespace
 
 std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, size_t threads,
@@ -21,10 +26,11 @@ std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, s
     auto poller = std::make_shared<RelayPoller>(Passkey{});
     poller->epoll_.reset(::epoll_create1(EPOLL_CLOEXEC));
     poller->wake_.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    poller->sentryTimer_.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC));
     epoll_event event{};
     event.events = EPOLLIN;
     event.data.u64 = kWakeToken;
-    if (!poller->epoll_ || !poller->wake_ ||
+    if (!poller->epoll_ || !poller->wake_ || !poller->sentryTimer_ ||
         ::epoll_ctl(poller->epoll_.get(), EPOLL_CTL_ADD, poller->wake_.get(), &event) != 0) {
         if (why) *why = std::string("cannot set up the relay's epoll loop: ") + strerror(errno);
         return nullptr;
@@ -61,6 +67,10 @@ bool RelayPoller::isPollerThread() const {
     const std::thread::id self = std::this_thread::get_id();
     return std::any_of(threads_.begin(), threads_.end(),
                        [self](const std::thread& thread) { return thread.get_id() == self; });
+}
+
+bool RelayPoller::busy() const {
+    return handling_.load(std::memory_order_relaxed) > 0 || foundWaiting;
 }
 
 bool RelayPoller::reserveInline() {
@@ -115,6 +125,15 @@ void RelayPoller::stop() {
             (void)!::write(wake_.get(), &one, sizeof one);
         }
     }
+    {
+        // Taken so that a thread about to stand by either sees stopping_
+        // or is already waiting for this.
+        std::lock_guard standby(standbyMutex_);
+    }
+    standbyChanged_.notify_all();
+    itimerspec now{};
+    now.it_value.tv_nsec = 1;
+    ::timerfd_settime(sentryTimer_.get(), 0, &now, nullptr);  // wakes the sentry
     {
         std::lock_guard join(joinMutex_);
         for (std::thread& thread : threads_)
@@ -175,6 +194,83 @@ void RelayPoller::serveParked() {
     while (std::shared_ptr<Watcher> watcher = takeParked(true)) watcher->unpark();
 }
 
+bool RelayPoller::isStopping() {
+    std::lock_guard lock(mutex_);
+    return stopping_;
+}
+
+std::optional<int> RelayPoller::waitAsReader(epoll_event* events, int capacity) {
+    if (waiting_.fetch_add(1) != 0) {
+        waiting_.fetch_sub(1);
+        return std::nullopt;
+    }
+    // Asked first without waiting, to know whether peers queue up.
+    int count = ::epoll_wait(epoll_.get(), events, capacity, 0);
+    foundWaiting = count > 0;
+    if (count == 0) {
+        const int timeout = parkedTimeout();
+        if (timeout != 0) count = ::epoll_wait(epoll_.get(), events, capacity, timeout);
+    }
+    const int error = errno;
+    waiting_.fetch_sub(1);
+    // What the caller does now may block: the sentry reads in its place
+    // unless it is back in time.
+    if (count != 0 || parkedCount_.load(std::memory_order_relaxed) > 0) armSentry();
+    errno = error;
+    return count;
+}
+
+bool RelayPoller::standBy() {
+    std::unique_lock lock(standbyMutex_);
+    for (;;) {
+        if (isStopping()) return false;
+        if (!sentryPosted_) {
+            sentryPosted_ = true;
+            const bool read = keepSentry(lock);
+            sentryPosted_ = false;
+            // Another standing-by thread is the sentry from now on.
+            standbyChanged_.notify_all();
+            return read;
+        }
+        standbyChanged_.wait(lock);
+    }
+}
+
+void RelayPoller::armSentry() {
+    if (threads_.size() < 2) return;  // nobody to take over
+    // Pushed forward only once half of kStandbyTick has passed: the timer
+    // then goes off between half of it and all of it after a reader last
+    // took work.
+    const Clock::rep now = Clock::now().time_since_epoch().count();
+    const Clock::rep half = std::chrono::duration_cast<Clock::duration>(kStandbyTick).count() / 2;
+    Clock::rep armed = sentryArmed_.load(std::memory_order_relaxed);
+    if (now - armed < half ||
+        !sentryArmed_.compare_exchange_strong(armed, now, std::memory_order_relaxed))
+        return;
+    itimerspec expiry{};
+    expiry.it_value.tv_nsec = std::chrono::nanoseconds(kStandbyTick).count();
+    ::timerfd_settime(sentryTimer_.get(), 0, &expiry, nullptr);
+}
+
+bool RelayPoller::keepSentry(std::unique_lock<std::mutex>& lock) {
+    lock.unlock();
+    bool read = false;
+    for (;;) {
+        uint64_t expirations = 0;
+        const ssize_t got = ::read(sentryTimer_.get(), &expirations, sizeof expirations);
+        if (isStopping()) break;
+        // Gone off (a failed read counts as such) while no thread waits on
+        // the set: none took work for half of kStandbyTick and none came
+        // back, so the readers are held up in what they took.
+        if (got != 0 && waiting_.load() == 0) {
+            read = true;
+            break;
+        }
+    }
+    lock.lock();
+    return read;
+}
+
 void RelayPoller::run() {
     epoll_event events[kEventsPerWait];
     // With several threads, each takes one event at a time: a thread that
@@ -182,9 +278,13 @@ void RelayPoller::run() {
     // for other peers.
     const int perWait = threads_.size() > 1 ? 1 : kEventsPerWait;
     for (;;) {
-        const int count = ::epoll_wait(epoll_.get(), events, perWait, parkedTimeout());
-        if (count < 0 && errno != EINTR) return;
-        for (int i = 0; i < count; ++i) {
+        const std::optional<int> count = waitAsReader(events, perWait);
+        if (!count) {
+            if (!standBy()) return;
+            continue;
+        }
+        if (*count < 0 && errno != EINTR) return;
+        for (int i = 0; i < *count; ++i) {
             std::shared_ptr<Watcher> watcher;
             {
                 std::lock_guard lock(mutex_);

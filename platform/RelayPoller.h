@@ -1,6 +1,6 @@
 // The I/O threads of the relay: one epoll set holding the listening socket
-// and every peer socket of a listener, waited on by a few threads, each of
-// which tells a watcher when its descriptor is ready.
+// and every peer socket of a listener, and a few threads that take turns
+// waiting on it, each of which tells a watcher when its descriptor is ready.
 //
 // Any number of peers are served by a few threads because nothing a thread
 // does for a socket blocks: every socket is non-blocking and frames are
@@ -8,26 +8,37 @@
 // (EPOLLONESHOT) is told by one thread at a time and re-arms itself with
 // modify(); others may be told by several threads at once.
 //
-// A request may run on the thread that read it, sparing a hop to another
-// thread, but only while another thread is left waiting: at most all threads
-// but one run such inline work at a time (reserveInline), so a request that
-// blocks never stops the reading of other peers. A request read while every
-// place is taken may wait parked (park) for the next thread that finishes
-// its inline work - a thread already running, so nobody is woken - for as
-// long as inline work keeps finishing: once no place has been given back
-// for kParkedWait (handlers that block, not a busy processor), or at the
-// latest kParkedLimit after it was parked, it goes to the pool (the
-// watcher's unpark()).
+// One thread at a time waits on the set (the reader); a thread that comes
+// back from its work while another waits there stands by instead. So a
+// busy relay runs on one thread that takes the next ready peer whenever it
+// is done with the last, in the order they became ready, as a bare server
+// loop would: no thread is woken per request and the requests of all peers
+// keep their turns. A request may run on the thread that read it; when the
+// reader has not come back from such work within about kStandbyTick (a
+// handler that blocks, or one that is simply long), the sentry - one of the
+// standing-by threads, asleep on a timer that each reader pushes forward
+// when it takes work - reads in its place, and so on while threads are
+// left. At most all threads but one run such inline work at a time
+// (reserveInline), so a request that blocks never stops the reading of
+// other peers for longer than that. A request read while every place is
+// taken may wait parked (park) for the next thread that finishes its inline
+// work - a thread already running, so nobody is woken - for as long as
+// inline work keeps finishing: once no place has been given back for
+// kParkedWait (handlers that block, not a busy processor), or at the latest
+// kParkedLimit after it was parked, it goes to the pool (the watcher's
+// unpark()).
 #pragma once
 
 #include <sys/epoll.h>
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <cstdint>
 #include <deque>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
 #include <unordered_map>
@@ -117,8 +128,16 @@ class RelayPoller {
       private:
         RelayPoller& poller_;
     };
-    // True while any request is being handled.
-    bool busy() const { return handling_.load(std::memory_order_relaxed) > 0; }
+    // True while any request is being handled, or when the calling poller
+    // thread found its last event already waiting: other peers are then
+    // waiting for their turn too.
+    bool busy() const;
+
+    // How long after a reader last took work, at most, a standing-by thread
+    // reads in its place if it has not come back (at least half of it): so
+    // about how long a reader stuck in a request holds up the peers behind
+    // it.
+    static constexpr std::chrono::milliseconds kStandbyTick{1};
 
     // Parks `watcher`'s work until a thread finishing inline work has a
     // place for it (runParked), or until kParkedWait has passed both since
@@ -135,6 +154,21 @@ class RelayPoller {
     };
 
     void run();
+    // Waits for events as the reader: their count (negative with errno
+    // set), or nothing when another thread already waits on the set (the
+    // caller then stands by).
+    std::optional<int> waitAsReader(epoll_event* events, int capacity);
+    // Until the caller is to read again (true) or the poller stops (false).
+    // One standing-by thread at a time is the sentry.
+    bool standBy();
+    // Sets the sentry's timer to go off kStandbyTick from now, unless it was
+    // set less than half of that ago.
+    void armSentry();
+    // The sentry's watch, entered with standbyMutex_ held (released while it
+    // waits): true when the readers were held up in their work and the
+    // caller is to read in their place, false when the poller stops.
+    bool keepSentry(std::unique_lock<std::mutex>& lock);
+    bool isStopping();
     // When parked work that came at `since` is to go elsewhere.
     Clock::time_point expiry(Clock::time_point since) const;
     // The epoll timeout that wakes a waiting thread when the oldest parked
@@ -161,6 +195,13 @@ class RelayPoller {
     std::mutex parkMutex_;  // never held while calling a watcher
     std::deque<Parked> parked_;
     std::atomic<size_t> parkedCount_{0};  // parked_.size(), read without the lock
+
+    std::atomic<size_t> waiting_{0};          // threads in epoll_wait (at most one reads)
+    UniqueFd sentryTimer_;                    // timerfd the sentry sleeps on (armSentry)
+    std::atomic<Clock::rep> sentryArmed_{0};  // when sentryTimer_ was last set
+    std::mutex standbyMutex_;                 // never held while calling a watcher
+    std::condition_variable standbyChanged_;
+    bool sentryPosted_ = false;  // a standing-by thread is the sentry
 };
 
 }  // namespace berth

@@ -180,30 +180,44 @@ TEST(RelayTest, ThreadsSharingAClientConnectionEachGetTheirOwnReply) {
     EXPECT_EQ(mismatches.load(), 0);
 }
 
+// While a request blocks where it was read, another thread reads within
+// about a millisecond; that thread blocking in turn, the next one reads.
+// Rounds repeat so that the thread standing guard is handed on each time.
 TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
-    test::Event release, blocking;
+    constexpr int kRounds = 3;
+    std::array<test::Event, kRounds> release, blocking;
     RelayTestServer server([&](const RelayEvent& event, RelayReply& reply) {
-        if (event.message().find("Block")) blocking.set(), release.wait(10min);
+        if (event.message().find("Block")) {
+            const uint64_t round = numberAt(event.message(), "Block");
+            blocking.at(round).set();
+            release.at(round).wait(10min);
+        }
         reply.body().set("Seq", numberAt(event.message(), "Seq"));
     });
-    auto slow = connectTo(server);
+    std::vector<std::unique_ptr<BerthConnection>> slow;
+    std::vector<std::future<std::optional<Value>>> slowReplies;
     auto fast = connectTo(server);
-    ASSERT_TRUE(slow && fast);
-
-    auto slowReply = std::async(std::launch::async, [&] {
-        return slow->request(dict({{"Block", true}}), 30s);
-    });
-    ASSERT_TRUE(blocking.wait());
-    // The blocked handler still runs; the other peer is served meanwhile.
-    for (uint64_t seq = 0; seq < 20; ++seq) {
-        BerthError error;
-        auto reply = fast->request(dict({{"Seq", seq}}), 20s, &error);
-        ASSERT_TRUE(reply) << error.message;
-        EXPECT_EQ(numberAt(*reply, "Seq"), seq);
+    ASSERT_TRUE(fast);
+    for (uint64_t round = 0; round < kRounds; ++round) {
+        slow.push_back(connectTo(server));
+        ASSERT_TRUE(slow.back());
+        slowReplies.push_back(std::async(std::launch::async, [&connection = *slow.back(), round] {
+            return connection.request(dict({{"Block", round}}), 30s);
+        }));
+        ASSERT_TRUE(blocking[round].wait());
+        // The blocked handlers still run; the other peer is served meanwhile.
+        for (uint64_t seq = 0; seq < 20; ++seq) {
+            BerthError error;
+            auto reply = fast->request(dict({{"Seq", seq}}), 20s, &error);
+            ASSERT_TRUE(reply) << error.message;
+            EXPECT_EQ(numberAt(*reply, "Seq"), seq);
+        }
+        EXPECT_EQ(slowReplies.back().wait_for(0s), std::future_status::timeout);
+        // The first round's handler goes on blocking through the second.
+        if (round > 0) release[round].set();
     }
-    EXPECT_EQ(slowReply.wait_for(0s), std::future_status::timeout);
-    release.set();
-    EXPECT_TRUE(slowReply.get());
+    release[0].set();
+    for (auto& reply : slowReplies) EXPECT_TRUE(reply.get());
 }
 
 // Requests run on the I/O thread that read them only while another thread is
