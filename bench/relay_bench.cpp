@@ -23,7 +23,11 @@
 //                   daemons run one after the other for each client count
 //
 //   relay_bench [seconds per measurement, default 2] [path of berthd]
-//               [--against=path of another berthd]
+//               [--against=path of another berthd] [--daemon-only] [--detail]
+//
+// --daemon-only leaves out the relay and relay+identity rows; --detail also
+// prints, per row, the tail of the round trips (p90 to the slowest) and the
+// fewest and most requests one client got through.
 #include <signal.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -167,12 +171,16 @@ struct Result {
     double requestsPerSecond = 0;
     double p50Microseconds = 0;
     double p99Microseconds = 0;
+    std::string detail;  // with --detail
 };
 
 // The bench client's own Data/Application container of user 501.
 Value lookupRequest(bool create) {
     return bench::lookupRequest(2, "sys.kelp.bench.client", create);
 }
+
+// Set by --detail: measure() then describes the tail too.
+bool printDetail = false;
 
 Result measure(const std::filesystem::path& path, int clients, double seconds) {
     const Value request = lookupRequest(false);
@@ -217,6 +225,21 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
     result.requestsPerSecond = static_cast<double>(all.size()) / elapsed;
     result.p50Microseconds = all[all.size() / 2];
     result.p99Microseconds = all[std::min(all.size() - 1, all.size() * 99 / 100)];
+    if (printDetail) {
+        size_t fewest = SIZE_MAX, most = 0;
+        for (const auto& mine : latencies) {
+            fewest = std::min(fewest, mine.size());
+            most = std::max(most, mine.size());
+        }
+        auto at = [&](double q) {
+            return all[std::min(all.size() - 1, static_cast<size_t>(all.size() * q))];
+        };
+        char line[160];
+        std::snprintf(line, sizeof line,
+                      "p90 %.0f p95 %.0f p99.9 %.0f max %.0f us; requests per client %zu to %zu",
+                      at(0.90), at(0.95), at(0.999), all.back(), fewest, most);
+        result.detail = line;
+    }
     return result;
 }
 
@@ -268,10 +291,15 @@ int main(int argc, char** argv) {
     using namespace berth;
     std::vector<std::string> positional;
     std::string against;
+    bool daemonOnly = false;
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         if (arg.rfind("--against=", 0) == 0)
             against = arg.substr(10);
+        else if (arg == "--daemon-only")
+            daemonOnly = true;
+        else if (arg == "--detail")
+            printDetail = true;
         else
             positional.push_back(arg);
     }
@@ -303,9 +331,11 @@ int main(int argc, char** argv) {
         const Result baseline = measure(dir / "echo", clients, seconds);
         std::vector<std::pair<const char*, Result>> rows = {
             {"echo", baseline},
-            {"relay", measure(dir / "relay", clients, seconds)},
-            {"relay+identity", measure(dir / "relay-identity", clients, seconds)},
         };
+        if (!daemonOnly) {
+            rows.emplace_back("relay", measure(dir / "relay", clients, seconds));
+            rows.emplace_back("relay+identity", measure(dir / "relay-identity", clients, seconds));
+        }
         if (!binary.empty()) rows.emplace_back("daemon", measureDaemon(binary, clients));
         if (!against.empty())
             rows.emplace_back("daemon (against)", measureDaemon(against, clients));
@@ -315,6 +345,8 @@ int main(int argc, char** argv) {
                         baseline.requestsPerSecond > 0
                             ? result.requestsPerSecond / baseline.requestsPerSecond
                             : 0.0);
+        for (const auto& [name, result] : rows)
+            if (!result.detail.empty()) std::printf("  %-15s %s\n", name, result.detail.c_str());
         for (const auto& [name, result] : rows) {
             if (std::string(name) == "echo") continue;
             bench::printSummary(
