@@ -297,8 +297,7 @@ void RelayPoller::run() {
             watcher->ready(events[i].events);
         }
         serveParked();
-        std::lock_guard lock(mutex_);
-        if (stopping_) return;
+        if (isStopping()) return;
     }
 }
 

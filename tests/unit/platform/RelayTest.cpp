@@ -213,7 +213,7 @@ TEST(RelayTest, APeerWhoseHandlerBlocksDoesNotDelayAnother) {
             EXPECT_EQ(numberAt(*reply, "Seq"), seq);
         }
         EXPECT_EQ(slowReplies.back().wait_for(0s), std::future_status::timeout);
-        // The first round's handler goes on blocking through the second.
+        // The first round's handler goes on blocking through the later ones.
         if (round > 0) release[round].set();
     }
     release[0].set();
