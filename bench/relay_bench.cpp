@@ -171,16 +171,13 @@ struct Result {
     double requestsPerSecond = 0;
     double p50Microseconds = 0;
     double p99Microseconds = 0;
-    std::string detail;  // with --detail
+    std::string detail;  // the tail and the spread, printed with --detail
 };
 
 // The bench client's own Data/Application container of user 501.
 Value lookupRequest(bool create) {
     return bench::lookupRequest(2, "sys.kelp.bench.client", create);
 }
-
-// Set by --detail: measure() then describes the tail too.
-bool printDetail = false;
 
 Result measure(const std::filesystem::path& path, int clients, double seconds) {
     const Value request = lookupRequest(false);
@@ -223,23 +220,21 @@ Result measure(const std::filesystem::path& path, int clients, double seconds) {
     if (all.empty()) return result;
     std::sort(all.begin(), all.end());
     result.requestsPerSecond = static_cast<double>(all.size()) / elapsed;
-    result.p50Microseconds = all[all.size() / 2];
-    result.p99Microseconds = all[std::min(all.size() - 1, all.size() * 99 / 100)];
-    if (printDetail) {
-        size_t fewest = SIZE_MAX, most = 0;
-        for (const auto& mine : latencies) {
-            fewest = std::min(fewest, mine.size());
-            most = std::max(most, mine.size());
-        }
-        auto at = [&](double q) {
-            return all[std::min(all.size() - 1, static_cast<size_t>(all.size() * q))];
-        };
-        char line[160];
-        std::snprintf(line, sizeof line,
-                      "p90 %.0f p95 %.0f p99.9 %.0f max %.0f us; requests per client %zu to %zu",
-                      at(0.90), at(0.95), at(0.999), all.back(), fewest, most);
-        result.detail = line;
+    auto at = [&](double q) {
+        return all[std::min(all.size() - 1, static_cast<size_t>(all.size() * q))];
+    };
+    result.p50Microseconds = at(0.50);
+    result.p99Microseconds = at(0.99);
+    size_t fewest = SIZE_MAX, most = 0;
+    for (const auto& mine : latencies) {
+        fewest = std::min(fewest, mine.size());
+        most = std::max(most, mine.size());
     }
+    char line[160];
+    std::snprintf(line, sizeof line,
+                  "p90 %.0f p95 %.0f p99.9 %.0f max %.0f us; requests per client %zu to %zu",
+                  at(0.90), at(0.95), at(0.999), all.back(), fewest, most);
+    result.detail = line;
     return result;
 }
 
@@ -291,7 +286,7 @@ int main(int argc, char** argv) {
     using namespace berth;
     std::vector<std::string> positional;
     std::string against;
-    bool daemonOnly = false;
+    bool daemonOnly = false, printDetail = false;
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         if (arg.rfind("--against=", 0) == 0)
@@ -346,7 +341,7 @@ int main(int argc, char** argv) {
                             ? result.requestsPerSecond / baseline.requestsPerSecond
                             : 0.0);
         for (const auto& [name, result] : rows)
-            if (!result.detail.empty()) std::printf("  %-15s %s\n", name, result.detail.c_str());
+            if (printDetail) std::printf("  %-15s %s\n", name, result.detail.c_str());
         for (const auto& [name, result] : rows) {
             if (std::string(name) == "echo") continue;
             bench::printSummary(
