@@ -85,7 +85,7 @@ void RelayConnection::resume() {
         if (resumed_) return;
         resumed_ = true;
         if (!closed_) {
-            interest_ = EPOLLIN;
+            interest_ = EPOLLIN | EPOLLRDHUP;
             token_ = poller_->add(socket_.get(), interest_ | EPOLLONESHOT, shared_from_this());
             if (token_ == 0)
                 closeLocked(kLogError,
@@ -143,15 +143,19 @@ void RelayConnection::ready(uint32_t events) {
         Released released(*this);
         std::lock_guard lock(mutex_);
         if (closed_) return;
-        if ((events & EPOLLOUT) && !flushLocked(released)) return;
-        if (events & EPOLLIN) {
-            readLocked(released, &runHere);
-        } else if (events & (EPOLLHUP | EPOLLERR | EPOLLRDHUP)) {
+        // The delivery disarmed the one-shot registration.
+        interest_ = 0;
+        // A peer that hung up, or shut down its writing side, gives up the
+        // requests it sent that have not started: nothing more is read.
+        if (events & (EPOLLHUP | EPOLLERR | EPOLLRDHUP)) {
             closeLocked(kLogDebug, "the peer hung up", released);
+            return;
         }
+        if ((events & EPOLLOUT) && !flushLocked(released)) return;
+        if (events & EPOLLIN) readLocked(released, &runHere);
         chargeLocked(released);
         if (runHere) runningInline_ = true;
-        updateInterestLocked(true);
+        updateInterestLocked();
     }
     if (runHere) runInline(std::move(*runHere));
 }
@@ -159,7 +163,8 @@ void RelayConnection::ready(uint32_t events) {
 void RelayConnection::runInline(RelayEvent event) {
     // Gives back the poller's place and arms the socket for reading again,
     // even on a throw. The peer's next request is not looked for here: it
-    // waits for its turn behind the peers that became ready before it.
+    // waits for its turn behind the peers that became ready before it. A
+    // hang-up during the run is reported as soon as the socket is armed.
     struct Finish {
         RelayConnection& connection;
         ~Finish() {
@@ -169,12 +174,22 @@ void RelayConnection::runInline(RelayEvent event) {
             // A request of the peer parked by the last read still counts
             // as running here.
             connection.runningInline_ = connection.parked_.has_value();
+            connection.heldUp_ = false;
             if (!connection.runningInline_) connection.takePeekedLocked(released);
             connection.chargeLocked(released);
-            connection.updateInterestLocked(true);
+            connection.updateInterestLocked();
         }
     } finish{*this};
+    const RelayPoller::InlineRun published(*poller_, *this);
     queue_->runClaimed([&] { deliver(event); }, true);
+}
+
+void RelayConnection::heldUp() {
+    Released released(*this);
+    std::lock_guard lock(mutex_);
+    if (!runningInline_) return;
+    heldUp_ = true;
+    updateInterestLocked();
 }
 
 void RelayConnection::runParked() {
@@ -197,9 +212,10 @@ void RelayConnection::unpark() {
         event = std::exchange(parked_, std::nullopt);
         if (!event) return;
         runningInline_ = false;
+        heldUp_ = false;
         takePeekedLocked(released);
         chargeLocked(released);
-        updateInterestLocked(true);
+        updateInterestLocked();
     }
     // Still claimed since it was parked: the request runs first, then what
     // the queue received meanwhile.
@@ -330,18 +346,21 @@ bool RelayConnection::flushLocked(Released& released) {
     return true;
 }
 
-void RelayConnection::updateInterestLocked(bool rearm) {
+void RelayConnection::updateInterestLocked() {
     if (closed_ || token_ == 0) return;
     uint32_t wanted = 0;
-    // While a request runs inline, only the peer's hang-up is waited for:
-    // it still ends the connection at once.
-    if (runningInline_)
-        wanted |= EPOLLRDHUP;
-    else if (queued_ < options_.limits.maxQueuedRequests &&
-             pendingOutputLocked() <= options_.limits.outputHighWater)
-        wanted |= EPOLLIN;
+    // While a request runs inline nothing of the peer is read. A hang-up
+    // then is watched for only once the request waits parked or has held
+    // its thread up: a short run ends first, and the arming after it
+    // reports the hang-up before anything more of the peer starts.
+    if (runningInline_) {
+        if (parked_ || heldUp_) wanted |= EPOLLRDHUP;
+    } else if (queued_ < options_.limits.maxQueuedRequests &&
+               pendingOutputLocked() <= options_.limits.outputHighWater) {
+        wanted |= EPOLLIN | EPOLLRDHUP;
+    }
     if (pendingOutputLocked() > 0) wanted |= EPOLLOUT;
-    if (wanted == interest_ && !rearm) return;
+    if (wanted == interest_) return;
     if (poller_->modify(socket_.get(), token_, wanted | EPOLLONESHOT) == 0) interest_ = wanted;
 }
 

@@ -19,6 +19,9 @@ constexpr int kEventsPerWait = 64;
 // asked (read by busy()).
 thread_local bool foundWaiting = false;
 
+// This poller thread's place in runs_.
+thread_local size_t runIndex = 0;
+
 }  // namespace
 
 std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, size_t threads,
@@ -38,13 +41,15 @@ std::shared_ptr<RelayPoller> RelayPoller::start(const std::string& threadName, s
     threads = std::max<size_t>(threads, 1);
     poller->inlinePlaces_ = threads - 1;
     poller->inlineCapacity_ = threads - 1;
+    poller->runs_.assign(threads, Run{});
     // Each thread holds the poller until it ends, so a watcher that drops
     // the last other reference from inside ready() cannot free the loop
     // under its feet. No thread runs before all are in the vector.
     std::unique_lock starting(poller->startMutex_);
     for (size_t i = 0; i < threads; ++i)
-        poller->threads_.emplace_back([self = poller, name = threadName.substr(0, 15)] {
+        poller->threads_.emplace_back([self = poller, name = threadName.substr(0, 15), i] {
             ::pthread_setname_np(::pthread_self(), name.c_str());
+            runIndex = i;
             { std::lock_guard started(self->startMutex_); }
             self->run();
         });
@@ -71,6 +76,37 @@ bool RelayPoller::isPollerThread() const {
 
 bool RelayPoller::busy() const {
     return handling_.load(std::memory_order_relaxed) > 0 || foundWaiting;
+}
+
+RelayPoller::InlineRun::InlineRun(RelayPoller& poller, Watcher& watcher)
+    : poller_(poller), slot_(poller.runs_.at(runIndex)) {
+    const Clock::rep now = Clock::now().time_since_epoch().count();
+    std::lock_guard lock(poller_.runsMutex_);
+    slot_ = {&watcher, now, false};
+}
+
+RelayPoller::InlineRun::~InlineRun() {
+    std::lock_guard lock(poller_.runsMutex_);
+    slot_ = Run{};
+}
+
+bool RelayPoller::tellHeldUp() {
+    const Clock::rep now = Clock::now().time_since_epoch().count();
+    const Clock::rep half = std::chrono::duration_cast<Clock::duration>(kStandbyTick).count() / 2;
+    bool younger = false;
+    // Under the lock: a watcher is told only while its run lasts, and so
+    // while it lives.
+    std::lock_guard lock(runsMutex_);
+    for (Run& run : runs_) {
+        if (!run.watcher || run.told) continue;
+        if (now - run.since < half) {
+            younger = true;
+            continue;
+        }
+        run.told = true;
+        run.watcher->heldUp();
+    }
+    return younger;
 }
 
 bool RelayPoller::reserveInline() {
@@ -247,8 +283,15 @@ void RelayPoller::armSentry() {
     if (now - armed < half ||
         !sentryArmed_.compare_exchange_strong(armed, now, std::memory_order_relaxed))
         return;
+    setSentryTimer(kStandbyTick);
+    // While readers keep taking work the timer never goes off: runs that
+    // hold other threads up are told here instead.
+    tellHeldUp();
+}
+
+void RelayPoller::setSentryTimer(std::chrono::nanoseconds after) {
     itimerspec expiry{};
-    expiry.it_value.tv_nsec = std::chrono::nanoseconds(kStandbyTick).count();
+    expiry.it_value.tv_nsec = after.count();
     ::timerfd_settime(sentryTimer_.get(), 0, &expiry, nullptr);
 }
 
@@ -259,6 +302,8 @@ bool RelayPoller::keepSentry(std::unique_lock<std::mutex>& lock) {
         uint64_t expirations = 0;
         const ssize_t got = ::read(sentryTimer_.get(), &expirations, sizeof expirations);
         if (isStopping()) break;
+        // Runs too young to tell yet are looked at again once they may not be.
+        if (tellHeldUp()) setSentryTimer(kStandbyTick / 2);
         // Gone off (a failed read counts as such) while no thread waits on
         // the set: none took work for half of kStandbyTick and none came
         // back, so the readers are held up in what they took.

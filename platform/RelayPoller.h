@@ -18,7 +18,10 @@
 // handler that blocks, or one that is simply long), the sentry - one of the
 // standing-by threads, asleep on a timer that each reader pushes forward
 // when it takes work - reads in its place, and so on while threads are
-// left. At most all threads but one run such inline work at a time
+// left. Inline work a thread publishes (InlineRun) and that has held it up
+// for half of kStandbyTick is told so (Watcher::heldUp), by the sentry when
+// its timer goes off or by a reader pushing the timer forward, whichever
+// comes first. At most all threads but one run such inline work at a time
 // (reserveInline), so a request that blocks never stops the reading of
 // other peers for longer than that. A request read while every place is
 // taken may wait parked (park) for the next thread that finishes its inline
@@ -50,6 +53,7 @@ namespace berth {
 
 class RelayPoller {
     struct Passkey {};
+    struct Run;
 
   public:
     // Made by start() only.
@@ -66,6 +70,25 @@ class RelayPoller {
         // The parked work found no place in time (or the poller stops): it
         // is to run elsewhere.
         virtual void unpark() {}
+        // The inline work published for this watcher (InlineRun) has held
+        // its thread up for between half of kStandbyTick and about twice
+        // it. Called once per run, from another poller thread, while the
+        // run lasts.
+        virtual void heldUp() {}
+    };
+
+    // Publishes, for as long as it lives, that the calling poller thread
+    // runs inline work for `watcher`, which lives at least as long.
+    class InlineRun {
+      public:
+        InlineRun(RelayPoller& poller, Watcher& watcher);
+        ~InlineRun();
+        InlineRun(const InlineRun&) = delete;
+        InlineRun& operator=(const InlineRun&) = delete;
+
+      private:
+        RelayPoller& poller_;
+        Run& slot_;
     };
 
     // A poller with `threads` threads running (at least one), or null with
@@ -148,6 +171,11 @@ class RelayPoller {
 
   private:
     using Clock = std::chrono::steady_clock;
+    struct Run {
+        Watcher* watcher = nullptr;
+        Clock::rep since = 0;  // when the run was published
+        bool told = false;     // heldUp() was called
+    };
     struct Parked {
         std::shared_ptr<Watcher> watcher;
         Clock::time_point since;
@@ -168,6 +196,11 @@ class RelayPoller {
     // waits): true when the readers were held up in their work and the
     // caller is to read in their place, false when the poller stops.
     bool keepSentry(std::unique_lock<std::mutex>& lock);
+    // Tells the watchers of inline work that has run for half of
+    // kStandbyTick that it holds its thread up; true when younger runs are
+    // left to tell later.
+    bool tellHeldUp();
+    void setSentryTimer(std::chrono::nanoseconds after);
     bool isStopping();
     // When parked work that came at `since` is to go elsewhere.
     Clock::time_point expiry(Clock::time_point since) const;
@@ -202,6 +235,8 @@ class RelayPoller {
     std::mutex standbyMutex_;                 // never held while calling a watcher
     std::condition_variable standbyChanged_;
     bool sentryPosted_ = false;  // a standing-by thread is the sentry
+    std::mutex runsMutex_;       // taken before a watcher's own lock, never after
+    std::vector<Run> runs_;      // per thread: the inline work it runs (InlineRun)
 };
 
 }  // namespace berth

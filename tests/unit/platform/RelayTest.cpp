@@ -271,28 +271,46 @@ TEST(RelayTest, HandlersBlockingWhereTheyWereReadNeverStopTheReading) {
 }
 
 TEST(RelayTest, APeerThatLeavesBeforeItsReplyCostsNothingButThatReply) {
-    test::Event release, blocking;
-    RelayTestServer server([&](const RelayEvent& event, RelayReply&) {
-        if (event.message().find("Block")) blocking.set(), release.wait(10min);
-    });
-    {
-        UniqueFd leaving = server.connectRaw();
-        ASSERT_TRUE(test::writeAll(leaving.get(), test::frameBytes(relay::FrameKind::Request, 1,
-                                                                   dict({{"Block", true}}))));
-        // A second request that will never start: its peer is gone by then.
-        ASSERT_TRUE(test::writeAll(
-            leaving.get(), test::frameBytes(relay::FrameKind::Request, 2, Value::dictionary())));
-        ASSERT_TRUE(blocking.wait());
-    }
-    // The connection ends as soon as the peer is gone; the handler under way
-    // finishes, its reply goes nowhere, and the request behind it never starts.
-    ASSERT_TRUE(server.waitFor([&] { return server.listener().connectionCount() == 0; }));
-    release.set();
-    EXPECT_TRUE(server.waitFor([&] { return server.unsent() == 1 && server.invalidated() == 1; }));
+    // Twice: right after connecting (the request may reach the connection's
+    // queue while it is being set up) and after an exchange, when it runs on
+    // the I/O thread that read it, where the hang-up is watched for only once
+    // the run holds the thread up.
+    for (const bool settled : {false, true}) {
+        SCOPED_TRACE(settled ? "after an exchange" : "right after connecting");
+        test::Event release, blocking;
+        RelayTestServer server(
+            [&](const RelayEvent& event, RelayReply&) {
+                if (event.message().find("Block")) blocking.set(), release.wait(10min);
+            },
+            {}, nullptr, {}, /*ioThreads=*/3);
+        {
+            UniqueFd leaving = server.connectRaw();
+            if (settled) {
+                ASSERT_TRUE(test::writeAll(
+                    leaving.get(),
+                    test::frameBytes(relay::FrameKind::Request, 1, Value::dictionary())));
+                ASSERT_EQ(test::readFrames(leaving.get(), 1).size(), 1u);
+            }
+            ASSERT_TRUE(test::writeAll(leaving.get(), test::frameBytes(relay::FrameKind::Request, 2,
+                                                                       dict({{"Block", true}}))));
+            // A request that will never start: its peer is gone by then.
+            ASSERT_TRUE(test::writeAll(leaving.get(), test::frameBytes(relay::FrameKind::Request, 3,
+                                                                       Value::dictionary())));
+            ASSERT_TRUE(blocking.wait());
+        }
+        // The connection ends as soon as the peer is gone; the handler under
+        // way finishes, its reply goes nowhere, and the request behind it
+        // never starts.
+        const bool ended = server.waitFor([&] { return server.listener().connectionCount() == 0; });
+        release.set();
+        EXPECT_TRUE(ended);
+        EXPECT_TRUE(
+            server.waitFor([&] { return server.unsent() == 1 && server.invalidated() == 1; }));
 
-    auto other = connectTo(server);
-    BerthError error;
-    EXPECT_TRUE(other->request(Value::dictionary(), 20s, &error)) << error.message;
+        auto other = connectTo(server);
+        BerthError error;
+        EXPECT_TRUE(other->request(Value::dictionary(), 20s, &error)) << error.message;
+    }
 }
 
 // A frame header declaring `length` body bytes, with the given magic,
