@@ -60,13 +60,38 @@ uint64_t BTHCodeSigningMapping::processCallerRegisteredEntitlements(const Value&
 
 bool BTHCodeSigningMapping::callerEntitlementsNeedNoProcessing(const Value& entitlements,
                                                                const std::string& identifier) {
+    if (knownToNeedNoProcessing(identifier, entitlements)) return true;
     return onCodeSignQueue([&] {
+        bool unchanged = false;
         const BTHCodeSigningEntry* entry = storedEntry(identifier);
-        if (!(entry && entry->isRegisteredByCaller()))
-            return onQueueCodeSigningInfoForIdentifier(identifier, false).has_value();
-        auto [info, options] = callerRegisteredInfo(entitlements);
-        return isUnchanged(info, identifier, options);
+        if (!(entry && entry->isRegisteredByCaller())) {
+            unchanged = onQueueCodeSigningInfoForIdentifier(identifier, false).has_value();
+        } else {
+            auto [info, options] = callerRegisteredInfo(entitlements);
+            unchanged = isUnchanged(info, identifier, options);
+        }
+        // Read on the queue, after any change the look made itself.
+        if (unchanged) rememberNeedsNoProcessing(identifier, entitlements, version_.load());
+        return unchanged;
     });
+}
+
+bool BTHCodeSigningMapping::knownToNeedNoProcessing(const std::string& identifier,
+                                                    const Value& entitlements) {
+    std::lock_guard lock(noProcessingMutex_);
+    const auto known = noProcessingNeeded_.find(identifier);
+    return known != noProcessingNeeded_.end() && known->second.version == version_.load() &&
+           known->second.entitlements == entitlements;
+}
+
+void BTHCodeSigningMapping::rememberNeedsNoProcessing(const std::string& identifier,
+                                                      const Value& entitlements, uint64_t version) {
+    // Bounded by the signed identifiers that connect; a flood of them only
+    // starts the memory over.
+    constexpr size_t kRemembered = 4096;
+    std::lock_guard lock(noProcessingMutex_);
+    if (noProcessingNeeded_.size() >= kRemembered) noProcessingNeeded_.clear();
+    noProcessingNeeded_.insert_or_assign(identifier, NoProcessingNeeded{entitlements, version});
 }
 
 void BTHCodeSigningMapping::withdrawSystemContainer(const std::string& identifier) {

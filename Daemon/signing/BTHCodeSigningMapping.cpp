@@ -79,6 +79,9 @@ BTHCodeSigningMapping::readCodeSigningMappingFromDisk() {
 
 BTHErrorRef BTHCodeSigningMapping::writeCodeSigningMappingToDisk() {
     BTH_FUNCTION("-[BTHCodeSigningMapping _writeCodeSigningMappingToDisk]");
+    // Every change of the mapping is written: answers given before it no
+    // longer hold.
+    version_.fetch_add(1);
     Value serialized = Value::dictionary();
     for (const auto& [identifier, entry] : codeSigningMappingDict_)
         if (entry) serialized.set(identifier, entry->serialize());

@@ -21,11 +21,13 @@
 
 #include <sys/types.h>
 
+#include <atomic>
 #include <cstdint>
 #include <filesystem>
 #include <functional>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -156,7 +158,8 @@ class BTHCodeSigningMapping {
     // Whether a caller's own entitlements would change nothing: the
     // identifier has code-signing information that the caller did not
     // register, or its caller-registered entitlements are these already. One
-    // look at the mapping, made for every request of a signed caller.
+    // look at the mapping, made for every request of a signed caller; a yes
+    // is remembered per identifier until the mapping next changes.
     bool callerEntitlementsNeedNoProcessing(const Value& entitlements,
                                             const std::string& identifier);
 
@@ -279,9 +282,26 @@ class BTHCodeSigningMapping {
         return codeSignQueue_->sync(std::forward<F>(work));
     }
 
+    // Whether callerEntitlementsNeedNoProcessing() said so for these
+    // entitlements of `identifier` at the current version of the mapping.
+    bool knownToNeedNoProcessing(const std::string& identifier, const Value& entitlements);
+    void rememberNeedsNoProcessing(const std::string& identifier, const Value& entitlements,
+                                   uint64_t version);
+
     std::shared_ptr<WorkQueue> codeSignQueue_;
     Mapping codeSigningMappingDict_;
     BTHCodeSigningHooks hooks_;
+    // Counts the changes of the mapping (each is written, or tried to be):
+    // an answer about the mapping holds while the count stays.
+    std::atomic<uint64_t> version_{0};
+    // Callers' entitlements found to need no processing, with the version
+    // they were found at: a signed caller's requests repeat the question.
+    struct NoProcessingNeeded {
+        Value entitlements;
+        uint64_t version = 0;
+    };
+    std::mutex noProcessingMutex_;
+    std::map<std::string, NoProcessingNeeded, std::less<>> noProcessingNeeded_;
 };
 
 }  // namespace berth

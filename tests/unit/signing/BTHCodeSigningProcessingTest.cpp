@@ -123,6 +123,36 @@ TEST_F(BTHCodeSigningProcessingTest, TheSameInformationTwiceChangesAndWritesNoth
     EXPECT_EQ(mapping_->dataContainerTypeForIdentifier("a.app"), 0u);
 }
 
+// The answer is asked for on every request of a signed caller and may be
+// remembered, but never past a change of the mapping.
+TEST_F(BTHCodeSigningProcessingTest, ACallersOwnEntitlementsNeedProcessingWheneverTheyWouldChange) {
+    const Value own = dict({{kBTHApplicationGroupsEntitlement, BTHStringListValue({"G"})}});
+    const Value other = dict({{kBTHApplicationGroupsEntitlement, BTHStringListValue({"H"})}});
+    auto needNone = [&](const Value& entitlements) {
+        return mapping_->callerEntitlementsNeedNoProcessing(entitlements, "c.app");
+    };
+    EXPECT_FALSE(needNone(own));  // no entry yet
+    ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(own, "c.app"), 1u);
+    EXPECT_TRUE(needNone(own));
+    EXPECT_TRUE(needNone(own));
+    EXPECT_FALSE(needNone(other));
+    EXPECT_FALSE(mapping_->callerEntitlementsNeedNoProcessing(own, "d.app"));
+
+    ASSERT_EQ(process("c.app", std::nullopt), 1u);  // the entry went
+    EXPECT_FALSE(needNone(own));
+    ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(own, "c.app"), 1u);
+    EXPECT_TRUE(needNone(own));
+    ASSERT_EQ(mapping_->processCallerRegisteredEntitlements(other, "c.app"), 1u);
+    EXPECT_FALSE(needNone(own));
+    EXPECT_TRUE(needNone(other));
+
+    // Information the installer reported stands, whatever the caller has.
+    ASSERT_EQ(process("c.app", groups({"I"})), 1u);
+    EXPECT_TRUE(needNone(own));
+    ASSERT_EQ(process("c.app", std::nullopt), 1u);
+    EXPECT_FALSE(needNone(own));
+}
+
 TEST_F(BTHCodeSigningProcessingTest, NoInformationRemovesAKnownIdentifierAndIgnoresAnUnknownOne) {
     EXPECT_EQ(process("ghost", std::nullopt), 1u);
     EXPECT_FALSE(stdfs::exists(file_));
