@@ -17,12 +17,20 @@ BTHMetadataPresence::BTHMetadataPresence() {
 bool BTHMetadataPresence::itemExists(const std::filesystem::path& metadataFile) {
     BTHFileManager& files = BTHFileManager::defaultManager();
     if (!watch_) return files.itemExistsAtURL(metadataFile);
+    // The common answer needs only the moment; the ticket (a name for each
+    // directory up to the root) is copied only when something changed.
+    std::optional<uint64_t> foundAt;
+    {
+        std::lock_guard lock(mutex_);
+        if (auto at = found_.find(metadataFile.native()); at != found_.end())
+            foundAt = at->second.moment;
+    }
+    if (foundAt && watch_->unchangedSince(*foundAt)) return true;
     std::optional<Found> found;
     {
         std::lock_guard lock(mutex_);
         if (auto at = found_.find(metadataFile.native()); at != found_.end()) found = at->second;
     }
-    if (found && watch_->unchangedSince(found->moment)) return true;
 
     // The moment comes first: a change after it is either seen by the check
     // below (of the file's own names, or of the disk) or counted by the watch.
