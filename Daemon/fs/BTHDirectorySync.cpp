@@ -3,8 +3,10 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <string_view>
 
 #include "platform/SafeFs.h"
 
@@ -39,11 +41,39 @@ int BTHDirectorySync::syncDirectory(const std::filesystem::path& path) {
     return ::fsync(fd.get()) == 0 ? 0 : errno;
 }
 
+namespace {
+
+// Whether the absolute `path` reads the same once lexically normal: no
+// empty, "." or ".." component, no slash at the end.
+bool isLexicallyNormal(std::string_view path) {
+    if (path.size() < 2 || path.front() != '/') return false;
+    for (size_t start = 1; start <= path.size();) {
+        const size_t end = std::min(path.find('/', start), path.size());
+        const std::string_view part = path.substr(start, end - start);
+        if (part.empty() || part == "." || part == "..") return false;
+        start = end + 1;
+    }
+    return true;
+}
+
+}  // namespace
+
 BTHDirectorySync::Directory& BTHDirectorySync::directoryAt(const std::filesystem::path& directory) {
+    // Looked up on every look-up of a container (creation's check of the
+    // class directory): a path that is already normal is found as it is.
+    std::string normalized;
+    std::string_view key = directory.native();
+    if (!isLexicallyNormal(key)) {
+        normalized = directory.lexically_normal().string();
+        // A slash at the end names the same directory.
+        while (normalized.size() > 1 && normalized.back() == '/') normalized.pop_back();
+        key = normalized;
+    }
     std::lock_guard<std::mutex> lock(mutex_);
-    std::unique_ptr<Directory>& slot = directories_[directory.lexically_normal().string()];
-    if (!slot) slot = std::make_unique<Directory>();
-    return *slot;
+    auto found = directories_.find(key);
+    if (found == directories_.end())
+        found = directories_.emplace(std::string(key), std::make_unique<Directory>()).first;
+    return *found->second;
 }
 
 uint64_t BTHDirectorySync::noteChange(const std::filesystem::path& directory) {

@@ -70,6 +70,9 @@ class BTHDirectorySync {
         int failure = 0;             // and its error number
     };
 
+    // The record of `directory`, made on first use; every spelling of a
+    // directory (doubled slashes, "." and ".." components, a slash at the
+    // end) shares one.
     Directory& directoryAt(const std::filesystem::path& directory);
     // Runs one sync of `directory` on the caller's thread; `lock` is held
     // on entry and on return.
@@ -78,7 +81,7 @@ class BTHDirectorySync {
 
     const SyncFunction sync_;
     std::mutex mutex_;  // guards directories_ (not the records in it)
-    std::map<std::string, std::unique_ptr<Directory>> directories_;
+    std::map<std::string, std::unique_ptr<Directory>, std::less<>> directories_;
 };
 
 }  // namespace berth

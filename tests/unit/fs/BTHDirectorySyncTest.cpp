@@ -172,6 +172,22 @@ TEST(BTHDirectorySyncTest, DirectoriesAreSyncedApart) {
     EXPECT_TRUE(calls[1].first);
 }
 
+TEST(BTHDirectorySyncTest, EverySpellingOfADirectoryCountsItsChangesTogether) {
+    BTHDirectorySync sync(RecordingSync().function());
+    uint64_t noted = 0;
+    for (const char* spelling :
+         {"/root/Containers/Data/Application", "/root/Containers/Data/Application/",
+          "/root//Containers/./Data/Application",
+          "/root/Containers/Data/Sprocket/../Application"}) {
+        SCOPED_TRACE(spelling);
+        EXPECT_EQ(sync.noteChange(spelling), ++noted);
+        EXPECT_EQ(sync.lastChange(kClass), noted);
+    }
+    EXPECT_EQ(sync.lastChange("/root/Containers/Data/Application/."), noted);
+    EXPECT_EQ(sync.lastChange("/root/Containers/Data/Applications"), 0u);
+    EXPECT_EQ(sync.lastChange("/root/Containers/Data"), 0u);
+}
+
 TEST(BTHDirectorySyncTest, RealSyncOfADirectoryAndOfWhatIsNotOne) {
     test::ScratchDir scratch;
     stdfs::create_directory(scratch / "class");
