@@ -27,8 +27,13 @@ RelayEvent RelayEvent::message(std::shared_ptr<RelayConnection> connection, rela
     RelayEvent event(Type::Message, std::move(connection));
     event.kind_ = frame.kind;
     event.messageId_ = frame.messageId;
-    event.message_ = std::move(frame.body);
+    event.message_ = std::make_shared<const Value>(std::move(frame.body));
     return event;
+}
+
+const Value& RelayEvent::message() const {
+    static const Value kNone;
+    return message_ ? *message_ : kNone;
 }
 
 RelayEvent RelayEvent::connectionInvalid(std::shared_ptr<RelayConnection> connection) {
@@ -108,10 +113,15 @@ bool RelayConnection::isOpen() const {
 }
 
 bool RelayConnection::sendReply(uint64_t messageId, const Value& body) {
-    std::vector<uint8_t> frame;
+    // Encoded into a buffer each thread keeps, so a reply allocates nothing
+    // once the buffer has grown to the replies' size (one that grew for a
+    // large reply is let go at the next).
+    thread_local std::vector<uint8_t> frame;
+    if (frame.capacity() > options_.limits.outputHighWater) frame = {};
+    frame.clear();
     relay::CodecError error = relay::CodecError::None;
     const bool encoded =
-        relay::encodeFrame({relay::FrameKind::Reply, messageId, body}, frame, &error);
+        relay::encodeFrame(relay::FrameKind::Reply, messageId, body, frame, &error);
 
     Released released(*this);
     std::lock_guard lock(mutex_);

@@ -114,7 +114,9 @@ class RelayEvent {
     relay::FrameKind kind() const { return kind_; }
     uint64_t messageId() const { return messageId_; }
     // The message dictionary (null for ConnectionInvalid).
-    const Value& message() const { return message_; }
+    const Value& message() const;
+    // The same, to be kept beyond the event without a copy.
+    const std::shared_ptr<const Value>& sharedMessage() const { return message_; }
     const std::shared_ptr<RelayConnection>& connection() const { return connection_; }
 
     // True for a request, whose sender waits for a reply.
@@ -132,7 +134,7 @@ class RelayEvent {
     Type type_;
     relay::FrameKind kind_ = relay::FrameKind::Message;
     uint64_t messageId_ = 0;
-    Value message_;
+    std::shared_ptr<const Value> message_;  // null for ConnectionInvalid
     std::shared_ptr<RelayConnection> connection_;
 };
 

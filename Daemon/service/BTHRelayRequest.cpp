@@ -26,11 +26,11 @@ BTHPeerIdentity toPeerIdentity(RelayPeerIdentity relay) {
 class RelayRequest final : public BTHRequest {
   public:
     RelayRequest(const RelayEvent& event, RelayReply reply)
-        : message_(event.message()),
+        : message_(event.sharedMessage()),
           reply_(std::move(reply)),
           peer_(toPeerIdentity(event.connection()->peerIdentity())) {}
 
-    const Value& message() const override { return message_; }
+    const Value& message() const override { return *message_; }
     Value& reply() override { return reply_.body(); }
     const BTHPeerIdentity& peer() const override { return peer_; }
     void sendReply() override {
@@ -38,7 +38,7 @@ class RelayRequest final : public BTHRequest {
     }
 
   private:
-    Value message_;
+    std::shared_ptr<const Value> message_;  // shared with the event
     RelayReply reply_;
     BTHPeerIdentity peer_;
 };

@@ -414,15 +414,23 @@ bool decodeValue(std::span<const uint8_t> body, Value& value, CodecError* error)
 }
 
 bool encodeFrame(const Frame& frame, std::vector<uint8_t>& out, CodecError* error) {
+    return encodeFrame(frame.kind, frame.messageId, frame.body, out, error);
+}
+
+bool encodeFrame(FrameKind kind, uint64_t messageId, const Value& body, std::vector<uint8_t>& out,
+                 CodecError* error) {
+    // Room for a typical reply at once rather than growing byte by byte.
+    constexpr size_t kTypicalFrame = 512;
     size_t original = out.size();
+    out.reserve(original + kTypicalFrame);
     out.push_back(kRelayMagic0);
     out.push_back(kRelayMagic1);
     out.push_back(kRelayVersion);
-    out.push_back(static_cast<uint8_t>(frame.kind));
-    putU64(out, frame.messageId);
+    out.push_back(static_cast<uint8_t>(kind));
+    putU64(out, messageId);
     putU32(out, 0);  // body length, filled in below
     size_t bodyStart = out.size();
-    if (!encodeValue(frame.body, out, error)) {
+    if (!encodeValue(body, out, error)) {
         out.resize(original);
         return false;
     }

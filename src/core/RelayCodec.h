@@ -109,6 +109,10 @@ bool decodeValue(std::span<const uint8_t> body, Value& value, CodecError* error 
 
 // Appends header and body of `frame` to `out`; same failures as encodeValue.
 bool encodeFrame(const Frame& frame, std::vector<uint8_t>& out, CodecError* error = nullptr);
+// The same for a frame given by its parts, so that a body need not be
+// copied into a Frame.
+bool encodeFrame(FrameKind kind, uint64_t messageId, const Value& body, std::vector<uint8_t>& out,
+                 CodecError* error = nullptr);
 
 // Turns the bytes of a stream, in whatever pieces they arrive, into frames.
 //
