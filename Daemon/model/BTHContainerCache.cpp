@@ -92,11 +92,10 @@ BTHMetadataRef BTHContainerCache::containerForUser(uid_t userId, uint64_t contai
                                             suffix, url));
             return nullptr;
         }
-        const std::filesystem::path metadataFile = BTHMetadata::metadataFileURL(url);
-        if (!presence_.itemExists(metadataFile)) {
+        if (!presence_.metadataFileExists(url)) {
             BTHSetError(error, BTHMakeError(BTHErrorCacheInconsistent, nullptr,
                                             "Cache: %@%@: INCONSISTENT-No Metadata at: %@",
-                                            className, suffix, metadataFile));
+                                            className, suffix, BTHMetadata::metadataFileURL(url)));
             return nullptr;
         }
         BTHLogDebug("Cache: %@%@: Found Identifier: %@", className, suffix, identifier);

@@ -4,6 +4,7 @@
 
 #include "BTHFileManager.h"
 #include "BTHLog.h"
+#include "core/BTHContainerClass.h"
 
 namespace berth {
 
@@ -14,31 +15,32 @@ BTHMetadataPresence::BTHMetadataPresence() {
     if (!watch_) BTHLogError("Metadata files are checked on disk on every look-up: %s", why);
 }
 
-bool BTHMetadataPresence::itemExists(const std::filesystem::path& metadataFile) {
+bool BTHMetadataPresence::metadataFileExists(const std::filesystem::path& container) {
     BTHFileManager& files = BTHFileManager::defaultManager();
-    if (!watch_) return files.itemExistsAtURL(metadataFile);
+    if (!watch_) return files.itemExistsAtURL(container / kBTHMetadataFileName);
     // The common answer needs only the moment; the ticket (a name for each
     // directory up to the root) is copied only when something changed.
     std::optional<uint64_t> foundAt;
     {
         std::lock_guard lock(mutex_);
-        if (auto at = found_.find(metadataFile.native()); at != found_.end())
+        if (auto at = found_.find(container.native()); at != found_.end())
             foundAt = at->second.moment;
     }
     if (foundAt && watch_->unchangedSince(*foundAt)) return true;
     std::optional<Found> found;
     {
         std::lock_guard lock(mutex_);
-        if (auto at = found_.find(metadataFile.native()); at != found_.end()) found = at->second;
+        if (auto at = found_.find(container.native()); at != found_.end()) found = at->second;
     }
 
     // The moment comes first: a change after it is either seen by the check
     // below (of the file's own names, or of the disk) or counted by the watch.
     const uint64_t moment = watch_->now();
+    const std::filesystem::path metadataFile = container / kBTHMetadataFileName;
     if (found && watch_->unchangedSince(found->ticket, found->moment)) {
         // Something else changed: the file's names did not, so it is still
         // there, and is now known so as of `moment`.
-        remember(metadataFile, {std::move(found->ticket), moment, found->watchedAt});
+        remember(container, {std::move(found->ticket), moment, found->watchedAt});
         return true;
     }
     const auto now = std::chrono::steady_clock::now();
@@ -46,14 +48,14 @@ bool BTHMetadataPresence::itemExists(const std::filesystem::path& metadataFile) 
     ChangeWatch::Ticket ticket;
     const bool watched = rewatch && watch_->watch(metadataFile, &ticket);
     if (!files.itemExistsAtURL(metadataFile)) return false;
-    if (watched) remember(metadataFile, {std::move(ticket), moment, now});
+    if (watched) remember(container, {std::move(ticket), moment, now});
     return true;
 }
 
-void BTHMetadataPresence::remember(const std::filesystem::path& metadataFile, Found found) {
+void BTHMetadataPresence::remember(const std::filesystem::path& container, Found found) {
     std::lock_guard lock(mutex_);
     if (found_.size() >= kMaxFound) found_.clear();
-    found_[metadataFile.native()] = std::move(found);
+    found_[container.native()] = std::move(found);
 }
 
 void BTHMetadataPresence::reset() {

@@ -39,9 +39,10 @@ class BTHMetadataPresence {
     BTHMetadataPresence(const BTHMetadataPresence&) = delete;
     BTHMetadataPresence& operator=(const BTHMetadataPresence&) = delete;
 
-    // Whether an item (a link counts as one) is at `metadataFile`, an
-    // absolute path, with no link on the way. Safe from any thread.
-    bool itemExists(const std::filesystem::path& metadataFile);
+    // Whether an item (a link counts as one) is at the metadata file of the
+    // container at `container`, an absolute path, with no link on the way.
+    // Safe from any thread.
+    bool metadataFileExists(const std::filesystem::path& container);
 
     // Forgets every file found (the watch stays).
     void reset();
@@ -54,7 +55,7 @@ class BTHMetadataPresence {
         uint64_t moment;             // the watch's, taken before the file was found
         std::chrono::steady_clock::time_point watchedAt;
     };
-    void remember(const std::filesystem::path& metadataFile, Found found);
+    void remember(const std::filesystem::path& container, Found found);
     // Files remembered at most; beyond it all are forgotten at once.
     static constexpr size_t kMaxFound = size_t{1} << 16;
 

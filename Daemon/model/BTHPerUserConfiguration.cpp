@@ -45,6 +45,14 @@ BTHPerUserConfiguration::BTHPerUserConfiguration(uid_t userId) : userId_(userId)
         return;
     }
     userHomeDirectory_ = realHome(user->home);
+    for (uint64_t containerClass = 0; containerClass < classDirectoryPaths_.size();
+         ++containerClass) {
+        if (!BTHContainerClassIsPerUser(containerClass)) continue;
+        for (const bool transient : {false, true})
+            classDirectoryPaths_[containerClass][transient] =
+                *userHomeDirectory_ / (transient ? kTransientBelowHome : kContainersBelowHome) /
+                BTHContainerClassName(containerClass);
+    }
 }
 
 bool BTHPerUserConfiguration::existsUserBaseDirectory() const {
@@ -131,9 +139,7 @@ BTHPerUserConfiguration::OptionalPath
 BTHPerUserConfiguration::containerDirectoryPathForContentClass(uint64_t containerClass,
                                                                bool transient) const {
     if (!BTHContainerClassIsPerUser(containerClass)) return std::nullopt;
-    OptionalPath base = underHome(transient ? kTransientBelowHome : kContainersBelowHome);
-    if (!base) return std::nullopt;
-    return *base / BTHContainerClassName(containerClass);
+    return classDirectoryPaths_[containerClass][transient];
 }
 
 }  // namespace berth

@@ -15,6 +15,7 @@
 
 #include <sys/types.h>
 
+#include <array>
 #include <cstdint>
 #include <filesystem>
 #include <mutex>
@@ -69,6 +70,9 @@ class BTHPerUserConfiguration {
 
     const uid_t userId_;
     OptionalPath userHomeDirectory_;
+    // containerDirectoryPathForContentClass() of every class, ordinary and
+    // transient, made once: every look-up of a container asks for one.
+    std::array<std::array<OptionalPath, 2>, 14> classDirectoryPaths_;
 
     std::recursive_mutex mutex_;
     OptionalPath userBaseDirectory_;
