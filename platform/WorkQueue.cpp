@@ -363,12 +363,12 @@ void WorkQueue::runClaimed(const std::function<void()>& work, bool drainAfter) {
         }
     } release{this};
     // Running as the queue's item would: as work of each target, outermost
-    // first.
-    std::vector<const WorkQueue*> chain{this};
-    for (auto queue = target(); queue; queue = queue->target()) chain.push_back(queue.get());
+    // first (each queue keeps its target alive).
     auto& running = tlsContext.running;
     const size_t depth = running.size();
-    running.insert(running.end(), chain.rbegin(), chain.rend());
+    for (const WorkQueue* queue = this; queue; queue = queue->target().get())
+        running.push_back(queue);
+    std::reverse(running.begin() + static_cast<ptrdiff_t>(depth), running.end());
     struct Unwind {
         std::vector<const WorkQueue*>& running;
         size_t depth;
