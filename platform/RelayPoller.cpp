@@ -81,8 +81,13 @@ bool RelayPoller::busy() const {
 RelayPoller::InlineRun::InlineRun(RelayPoller& poller, Watcher& watcher)
     : poller_(poller), slot_(poller.runs_.at(runIndex)) {
     const Clock::rep now = Clock::now().time_since_epoch().count();
-    std::lock_guard lock(poller_.runsMutex_);
-    slot_ = {&watcher, now, false};
+    {
+        std::lock_guard lock(poller_.runsMutex_);
+        slot_ = {&watcher, now, false};
+    }
+    // The timer may have gone off since this thread took the work, before
+    // the run was there to be told: it goes off again.
+    poller_.armSentry();
 }
 
 RelayPoller::InlineRun::~InlineRun() {
