@@ -39,7 +39,7 @@
 // peer is read, and the hang-up is watched for only once the request waits
 // parked or has held its thread up (RelayPoller::Watcher::heldUp): a short
 // run ends first, and the socket armed after it reports the hang-up before
-// anything else of the peer starts. That spares two epoll calls a request.
+// anything else of the peer starts. That spares an epoll call a request.
 #pragma once
 
 #include <cstddef>

@@ -20,10 +20,11 @@
 // when it takes work - reads in its place, and so on while threads are
 // left. Inline work a thread publishes (InlineRun) and that has held it up
 // for half of kStandbyTick is told so (Watcher::heldUp), by the sentry when
-// its timer goes off or by a reader pushing the timer forward, whichever
-// comes first. At most all threads but one run such inline work at a time
-// (reserveInline), so a request that blocks never stops the reading of
-// other peers for longer than that. A request read while every place is
+// its timer goes off or by a thread pushing the timer forward (a reader
+// taking work, a thread publishing a run), whichever comes first. At most
+// all threads but one run such inline work at a time (reserveInline), so a
+// request that blocks never stops the reading of other peers for longer
+// than that. A request read while every place is
 // taken may wait parked (park) for the next thread that finishes its inline
 // work - a thread already running, so nobody is woken - for as long as
 // inline work keeps finishing: once no place has been given back for
