@@ -1,5 +1,6 @@
 #include "core/RelayCodec.h"
 
+#include <algorithm>
 #include <bit>
 #include <cstring>
 
@@ -419,10 +420,12 @@ bool encodeFrame(const Frame& frame, std::vector<uint8_t>& out, CodecError* erro
 
 bool encodeFrame(FrameKind kind, uint64_t messageId, const Value& body, std::vector<uint8_t>& out,
                  CodecError* error) {
-    // Room for a typical reply at once rather than growing byte by byte.
+    // Room for a typical reply at once rather than growing byte by byte;
+    // doubling still, for callers that append many frames to one buffer.
     constexpr size_t kTypicalFrame = 512;
     size_t original = out.size();
-    out.reserve(original + kTypicalFrame);
+    if (out.capacity() < original + kTypicalFrame)
+        out.reserve(std::max(original + kTypicalFrame, 2 * out.capacity()));
     out.push_back(kRelayMagic0);
     out.push_back(kRelayMagic1);
     out.push_back(kRelayVersion);
